@@ -1,0 +1,15 @@
+// Process-wide state of the daemon. Written on the main thread only, except
+// the running flag, which the SIGTERM handler clears.
+#ifndef TARN_GLOBALS_H
+#define TARN_GLOBALS_H
+
+#include <csignal>
+
+extern volatile sig_atomic_t g_running;  // 1 while the loop turns
+extern int g_localSelected;              // 1: local player selected
+extern int g_selectedRenderer;           // renderer index, -1 for none
+extern int g_changed;                    // published at 4628
+extern int g_sourceType;                 // 0,1,2,3,4,6 (source change)
+extern char g_currentPlaylistPath[4096]; // saved playlist of source type 4
+
+#endif

@@ -1,0 +1,175 @@
+// Records shared between the daemon, its clients and mplayer-daemon. Their
+// layouts are fixed byte for byte; the static_asserts below guard them.
+#ifndef TARN_TYPES_H
+#define TARN_TYPES_H
+
+#include <cstddef>
+#include <cstdint>
+
+// ---------------------------------------------------------------------------
+// Song record of the media library (7336 bytes, host byte order).
+struct TARN_MEDIA_INFO {
+    uint32_t id;                 // 0    song id
+    char path[4096];             // 4    file path or URI
+    int32_t track;               // 4100
+    int32_t disc;                // 4104
+    int32_t year;                // 4108
+    char title[255];             // 4112
+    char album[255];             // 4367
+    char artist[510];            // 4622
+    char genre[510];             // 5132
+    char albumArtUrl[255];       // 5642
+    char reserved1[339];         // 5897
+    float duration;              // 6236 seconds
+    uint32_t bitrate;            // 6240
+    int32_t reserved2;           // 6244
+    int32_t sample;              // 6248 sample rate
+    int32_t channels;            // 6252
+    char reserved3[8];           // 6256
+    uint64_t size;               // 6264 bytes
+    char reserved4[1064];        // 6272
+};
+
+static_assert(sizeof(TARN_MEDIA_INFO) == 7336, "TARN_MEDIA_INFO size");
+static_assert(offsetof(TARN_MEDIA_INFO, path) == 4, "path");
+static_assert(offsetof(TARN_MEDIA_INFO, track) == 4100, "track");
+static_assert(offsetof(TARN_MEDIA_INFO, disc) == 4104, "disc");
+static_assert(offsetof(TARN_MEDIA_INFO, year) == 4108, "year");
+static_assert(offsetof(TARN_MEDIA_INFO, title) == 4112, "title");
+static_assert(offsetof(TARN_MEDIA_INFO, album) == 4367, "album");
+static_assert(offsetof(TARN_MEDIA_INFO, artist) == 4622, "artist");
+static_assert(offsetof(TARN_MEDIA_INFO, genre) == 5132, "genre");
+static_assert(offsetof(TARN_MEDIA_INFO, albumArtUrl) == 5642, "albumArtUrl");
+static_assert(offsetof(TARN_MEDIA_INFO, duration) == 6236, "duration");
+static_assert(offsetof(TARN_MEDIA_INFO, bitrate) == 6240, "bitrate");
+static_assert(offsetof(TARN_MEDIA_INFO, sample) == 6248, "sample");
+static_assert(offsetof(TARN_MEDIA_INFO, channels) == 6252, "channels");
+static_assert(offsetof(TARN_MEDIA_INFO, size) == 6264, "size");
+
+// ---------------------------------------------------------------------------
+// Control protocol: one 8196-byte request, one 8192-byte reply per connection.
+enum {
+    ACT_SOURCE_RANDOM = 1,
+    ACT_SOURCE_RADIO = 2,
+    ACT_SOURCE_IPOD = 3,
+    ACT_PLAY_PAUSE = 4,
+    ACT_STOP = 5,
+    ACT_NEXT = 6,
+    ACT_PREVIOUS = 7,
+    ACT_PLAY_INDEX = 8,
+    ACT_SEEK = 9,
+    ACT_MUTE = 10,
+    ACT_SET_VOLUME = 11,
+    ACT_VOLUME_UP = 12,
+    ACT_VOLUME_DOWN = 13,
+    ACT_SEARCH_SERVERS = 14,
+    ACT_SEARCH_RENDERERS = 15,
+    ACT_LIST_SERVERS = 16,
+    ACT_LIST_RENDERERS = 17,
+    ACT_SELECT_PLAYER = 18,
+    ACT_GET_STATUS = 19,
+    ACT_QUEUE_ADD = 20,
+    ACT_QUEUE_REMOVE = 21,
+    ACT_QUEUE_CLEAR = 22,
+    ACT_QUEUE_INSERT = 23,
+    ACT_QUEUE_SET_CURRENT = 24,
+    ACT_SET_REPEAT_MODE = 25,
+    ACT_TOGGLE_SHUFFLE = 26,
+    ACT_QUEUE_LIST = 27,
+    ACT_CLEAR_CHANGED = 28,
+    ACT_SET_CHANGED = 29,
+    ACT_CYCLE_REPEAT_MODE = 30,
+    ACT_SOURCE_PLAYLIST = 31,
+    ACT_SOURCE_CUSTOM = 32,
+    ACT_SOURCE_NEXT = 33,
+    ACT_SOURCE_PREVIOUS = 34,
+    ACT_SET_EQUALIZER = 35,
+    ACT_SAVE_CUSTOM = 36,
+};
+
+#define CTRL_PARAM_SIZE 8192
+#define CTRL_REQUEST_SIZE 8196
+#define CTRL_REPLY_SIZE 8192
+// ACT_QUEUE_INSERT carries its position as an int32 at this request offset.
+#define CTRL_INSERT_POS_OFFSET 6308
+
+struct ControlRequest {
+    int32_t action;
+    char parameter[CTRL_PARAM_SIZE];
+};
+static_assert(sizeof(ControlRequest) == CTRL_REQUEST_SIZE, "ControlRequest size");
+static_assert(offsetof(ControlRequest, parameter) == 4, "parameter offset");
+
+// ---------------------------------------------------------------------------
+// Shared status memory.
+#define TARN_SHM_KEY_PLAYER_DEFAULT 25521815
+#define TARN_SHM_KEY_PUBLISHED_DEFAULT 25521816
+#define TARN_SHM_PLAYER_SIZE 13104
+#define TARN_SHM_PUBLISHED_SIZE 4640
+
+// Player status segment, written by mplayer-daemon.
+struct PlayerStatusShm {
+    char unused0[4104];          // 0
+    int32_t value4104;           // 4104
+    int32_t value4108;           // 4108
+    int32_t state;               // 4112 player state (5: song ended)
+    int32_t value4116;           // 4116
+    char currentUri[4096];       // 4120
+    int32_t duration;            // 8216
+    int32_t position;            // 8220
+    char unused8224[4104];       // 8224
+    char radioStation[512];      // 12328
+    char streamTitle[264];       // 12840
+};
+static_assert(sizeof(PlayerStatusShm) == TARN_SHM_PLAYER_SIZE, "player segment size");
+static_assert(offsetof(PlayerStatusShm, state) == 4112, "state");
+static_assert(offsetof(PlayerStatusShm, currentUri) == 4120, "currentUri");
+static_assert(offsetof(PlayerStatusShm, duration) == 8216, "duration");
+static_assert(offsetof(PlayerStatusShm, position) == 8220, "position");
+static_assert(offsetof(PlayerStatusShm, radioStation) == 12328, "radioStation");
+static_assert(offsetof(PlayerStatusShm, streamTitle) == 12840, "streamTitle");
+
+// Published status segment, written by the daemon every loop turn.
+struct PublishedStatusShm {
+    char currentUri[4096];       // 0
+    int32_t duration;            // 4096
+    int32_t position;            // 4100
+    int32_t volume;              // 4104
+    int32_t index;               // 4108
+    int32_t state;               // 4112
+    char title[255];             // 4116
+    char artist[255];            // 4371
+    char padding[2];             // 4626
+    int32_t changed;             // 4628
+    int32_t shuffle;             // 4632
+    int32_t repeatMode;          // 4636
+};
+static_assert(sizeof(PublishedStatusShm) == TARN_SHM_PUBLISHED_SIZE, "published segment size");
+static_assert(offsetof(PublishedStatusShm, volume) == 4104, "volume");
+static_assert(offsetof(PublishedStatusShm, index) == 4108, "index");
+static_assert(offsetof(PublishedStatusShm, state) == 4112, "state");
+static_assert(offsetof(PublishedStatusShm, title) == 4116, "title");
+static_assert(offsetof(PublishedStatusShm, artist) == 4371, "artist");
+static_assert(offsetof(PublishedStatusShm, changed) == 4628, "changed");
+static_assert(offsetof(PublishedStatusShm, shuffle) == 4632, "shuffle");
+static_assert(offsetof(PublishedStatusShm, repeatMode) == 4636, "repeatMode");
+
+// Player states shared by both players and the published segment.
+enum {
+    PLAYER_STATE_NONE = 0,
+    PLAYER_STATE_STOPPED = 1,
+    PLAYER_STATE_PLAYING = 2,
+    PLAYER_STATE_PAUSED = 3,
+    PLAYER_STATE_TRANSITIONING = 4,
+    PLAYER_STATE_ENDED = 5,
+};
+
+// Fixed paths (placed under TARN_ROOT by TarnPath()).
+#define TARN_CTRL_SOCKET "/tmp/tarnaudiod.sock"
+#define TARN_MPLAYER_SOCKET "/tmp/mplayer.sock"
+#define TARN_PID_FILE "/var/run/tarnaudiod.pid"
+#define TARN_MPLAYER_PID_FILE "/var/run/mplayer.daemon.pid"
+#define TARN_MPLAYER_BIN "/usr/tarn/bin/mplayer-daemon"
+#define TARN_INFO_CONF "/etc/tarninfo.conf"
+
+#endif

@@ -1,0 +1,64 @@
+// Plays the local queue through mplayer-daemon.
+#ifndef TARN_LOCALPLAYER_H
+#define TARN_LOCALPLAYER_H
+
+#include <ctime>
+#include <string>
+
+#include <json/json.h>
+
+#include "daemon/tarn_types.h"
+
+class Playlist;
+
+class LocalPlayer {
+public:
+    LocalPlayer();
+    ~LocalPlayer();
+    LocalPlayer(const LocalPlayer &) = delete;
+    LocalPlayer &operator=(const LocalPlayer &) = delete;
+
+    int AttachMplayerFd(int fd);
+    int Poll(PlayerStatusShm *segment);
+    int PublishStatus(PublishedStatusShm *segment);
+    int HandleAction(const ControlRequest *request, Json::Value &reply);
+    int PlayPause();
+    int Stop();
+    int Next(bool automatic);
+    int Previous();
+    int PlayIndex(const char *text);
+    int Seek(const char *text);
+    int Mute();
+    int SetVolume(int volume);
+    int GetStatusJson(Json::Value &reply);
+    int SetEqualizer(const char *text);
+    void SaveVolumeAndKill();
+    void KillByName();
+    int GetCurrentSong(std::string &path, std::string &title);
+
+    Playlist *GetPlaylist() { return playlist; }
+    unsigned GetState() const { return state; }
+    int GetVolume() const { return volume; }
+    int GetMplayerFd() const { return mplayerFd; }
+
+private:
+    int StartMplayer(const std::string &uri);
+    int LoadFile(const std::string &uri);
+    int SendCommand(const char *bytes, size_t length);
+    bool IsMplayerAlive();
+    void KillMplayer();
+    void CloseMplayerFd();
+
+    uint32_t state;
+    Playlist *playlist;
+    std::string currentUri;
+    int32_t duration;
+    int32_t position;
+    int32_t mplayerFd;
+    std::string streamTitle;
+    std::string radioStation;
+    time_t lastVolumeCheck;
+    int32_t volume;
+};
+
+#endif

@@ -1,0 +1,60 @@
+// The play queue of one player.
+#ifndef TARN_PLAYLIST_H
+#define TARN_PLAYLIST_H
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include <json/json.h>
+
+#include "daemon/tarn_types.h"
+
+class Playlist {
+public:
+    Playlist();
+    ~Playlist();
+    Playlist(const Playlist &) = delete;
+    Playlist &operator=(const Playlist &) = delete;
+
+    int AddSong(const TARN_MEDIA_INFO *info);
+    int RemoveSong(unsigned index);
+    int Clear();
+    int InsertSong(unsigned index, const TARN_MEDIA_INFO *info);
+    int SetCurrent(unsigned index);
+    int SetMode(int mode);
+    int GetMode() const;
+    int ToggleShuffle();
+    int ToggleRepeatMode();
+    bool IsShuffle() const;
+    // Copies the current entry into *out.
+    int GetCurrentSong(TARN_MEDIA_INFO *out);
+    int GetCurrentUri(std::string &uri);
+    int GetCurrentInfoJson(Json::Value &info);
+    int Next(std::string &uri, bool automatic);
+    int Previous(std::string &uri, bool automatic);
+    int ListJson(int start, int limit, Json::Value &reply);
+    int HandleAction(const ControlRequest *request, Json::Value &reply);
+
+    unsigned Count() const { return static_cast<unsigned>(entries.size()); }
+    unsigned Current() const { return current; }
+    unsigned OrderIndex() const { return orderIndex; }
+    const std::vector<int32_t> &Order() const { return order; }
+    const TARN_MEDIA_INFO *Entry(unsigned index) const
+    {
+        return index < entries.size() ? entries[index] : nullptr;
+    }
+
+private:
+    void ResetOrder();
+    void ShuffleOrder();
+
+    std::vector<TARN_MEDIA_INFO *> entries;
+    std::vector<int32_t> order;
+    uint32_t current;
+    uint32_t orderIndex;
+    int32_t mode;
+    bool shuffle;
+};
+
+#endif
