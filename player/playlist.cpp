@@ -1,0 +1,463 @@
+#include "player/playlist.h"
+
+#include <algorithm>
+#include <cmath>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+
+#include "platform/tarn_log.h"
+#include "player/tarn_rand.h"
+
+static const char kLogUnit[] = "playlist";
+
+namespace {
+
+// Repeat mode names, indexed by the mode number.
+const char *const kModeNames[] = {"NONE", "Normal", "Repeat One", "Repeat All"};
+// Shown for a stored mode outside the table (SetMode stores any non-zero value).
+const char kModeUnknown[] = "Unknown";
+
+const char kDefaultAlbumArt[] = "modules/Aurelon/images/thumb/thumb_file.png";
+
+// Text fields of a record come from clients and need not be NUL-terminated:
+// read them only up to their field size.
+template <size_t N>
+std::string Field(const char (&text)[N])
+{
+    return std::string(text, strnlen(text, N));
+}
+
+const char *ModeName(int32_t mode)
+{
+    if (mode < 0 || mode > 3)
+        return kModeUnknown;
+    return kModeNames[mode];
+}
+
+// The title shown for a record: its title, else the file name of its path,
+// else the whole path.
+std::string DisplayTitle(const TARN_MEDIA_INFO *info)
+{
+    if (info->title[0] != '\0')
+        return Field(info->title);
+    std::string path = Field(info->path);
+    size_t slash = path.rfind('/');
+    if (slash != std::string::npos && slash + 1 < path.size())
+        return path.substr(slash + 1);
+    return path;
+}
+
+// The duration in whole seconds, truncated toward zero; 0 for values that do
+// not fit an int.
+int DurationSeconds(float duration)
+{
+    if (!std::isfinite(duration) || duration >= 2147483648.0f || duration <= -2147483649.0f)
+        return 0;
+    return static_cast<int>(duration);
+}
+
+// A decimal parameter read as the appliance's 32-bit strtol reads it: values
+// beyond the 32-bit range saturate instead of wrapping into a valid index.
+int32_t ParseDecimal(const std::string &text)
+{
+    long v = strtol(text.c_str(), nullptr, 10);
+    if (v > INT32_MAX)
+        return INT32_MAX;
+    if (v < INT32_MIN)
+        return INT32_MIN;
+    return static_cast<int32_t>(v);
+}
+
+}  // namespace
+
+Playlist::Playlist() : current(0), orderIndex(0), mode(1), shuffle(false)
+{
+}
+
+Playlist::~Playlist()
+{
+    for (TARN_MEDIA_INFO *entry : entries)
+        delete entry;
+}
+
+void Playlist::ResetOrder()
+{
+    order.clear();
+    for (size_t i = 0; i < entries.size(); ++i)
+        order.push_back(static_cast<int32_t>(i));
+    orderIndex = current;
+}
+
+void Playlist::ShuffleOrder()
+{
+    if (!shuffle)
+        return;
+    // Forward Fisher-Yates walk over the daemon's fixed random sequence, so
+    // that every start replays the same shuffles.
+    for (size_t i = 1; i < order.size(); ++i) {
+        size_t j = static_cast<size_t>(TarnRand()) % (i + 1);
+        std::swap(order[i], order[j]);
+    }
+    orderIndex = 0;
+}
+
+int Playlist::AddSong(const TARN_MEDIA_INFO *info)
+{
+    if (!info) {
+        TLOG("Bad parameter");
+        return -1;
+    }
+    TARN_MEDIA_INFO *copy = new (std::nothrow) TARN_MEDIA_INFO;
+    if (!copy) {
+        TLOG("Failed to new TARN_MEDIA_INFO");
+        return -1;
+    }
+    memcpy(copy, info, sizeof(TARN_MEDIA_INFO));
+    try {
+        entries.reserve(entries.size() + 1);
+        order.reserve(order.size() + 1);
+    } catch (const std::bad_alloc &) {
+        delete copy;
+        TLOG("Failed to new TARN_MEDIA_INFO");
+        return -1;
+    }
+    entries.push_back(copy);
+    order.push_back(static_cast<int32_t>(entries.size() - 1));
+    ShuffleOrder();
+    return 0;
+}
+
+int Playlist::RemoveSong(unsigned index)
+{
+    if (index >= entries.size()) {
+        TLOG("Bad parameters");
+        return -1;
+    }
+    if (!entries[index]) {
+        TLOG("URL_INFO at %d in list is NULL", static_cast<int>(index));
+        return -1;
+    }
+    delete entries[index];
+    entries.erase(entries.begin() + index);
+    if (index < current)
+        --current;
+    ResetOrder();
+    ShuffleOrder();
+    return 0;
+}
+
+int Playlist::Clear()
+{
+    for (TARN_MEDIA_INFO *entry : entries)
+        delete entry;
+    std::vector<TARN_MEDIA_INFO *>().swap(entries);
+    std::vector<int32_t>().swap(order);
+    current = 0;
+    orderIndex = 0;
+    return 0;
+}
+
+int Playlist::InsertSong(unsigned index, const TARN_MEDIA_INFO *info)
+{
+    // Inserting at the end (or into an empty queue) is refused: that is AddSong.
+    if (!info || index >= entries.size()) {
+        TLOG("Bad parameters");
+        return -1;
+    }
+    TARN_MEDIA_INFO *copy = new (std::nothrow) TARN_MEDIA_INFO;
+    if (!copy) {
+        TLOG("Failed to new TARN_MEDIA_INFO");
+        return -1;
+    }
+    memcpy(copy, info, sizeof(TARN_MEDIA_INFO));
+    try {
+        entries.reserve(entries.size() + 1);
+        order.reserve(entries.size() + 1);
+    } catch (const std::bad_alloc &) {
+        delete copy;
+        TLOG("Failed to new TARN_MEDIA_INFO");
+        return -1;
+    }
+    entries.insert(entries.begin() + index, copy);
+    if (index < current)
+        ++current;
+    ResetOrder();
+    ShuffleOrder();
+    return 0;
+}
+
+int Playlist::SetCurrent(unsigned index)
+{
+    if (index >= entries.size()) {
+        TLOG("Bad parameters");
+        return -1;
+    }
+    current = index;
+    if (!shuffle) {
+        orderIndex = index;
+        return 0;
+    }
+    for (size_t k = 0; k < order.size(); ++k) {
+        if (order[k] == static_cast<int32_t>(index)) {
+            orderIndex = static_cast<uint32_t>(k);
+            break;
+        }
+    }
+    return 0;
+}
+
+int Playlist::SetMode(int newMode)
+{
+    if (newMode == 0) {
+        TLOG("Bad parameter");
+        return -1;
+    }
+    mode = newMode;
+    // Shuffle and "Repeat One" never stand together.
+    if (mode == 2 && shuffle)
+        ToggleShuffle();
+    return 0;
+}
+
+int Playlist::GetMode() const
+{
+    return mode;
+}
+
+int Playlist::ToggleShuffle()
+{
+    if (shuffle) {
+        shuffle = false;
+        ResetOrder();
+    } else {
+        shuffle = true;
+        ShuffleOrder();
+        if (mode == 2)
+            mode = 1;
+    }
+    return 0;
+}
+
+int Playlist::ToggleRepeatMode()
+{
+    switch (mode) {
+    case 1:
+        return SetMode(2);
+    case 2:
+        return SetMode(3);
+    case 3:
+        return SetMode(1);
+    default:
+        TLOG("Failed to toggle repeat mode. Invalid playlist mode [%d]", mode);
+        return 0;
+    }
+}
+
+bool Playlist::IsShuffle() const
+{
+    return shuffle;
+}
+
+int Playlist::GetCurrentSong(TARN_MEDIA_INFO *out)
+{
+    if (entries.empty() || order.empty()) {
+        TLOG("Playlist is empty");
+        return -1;
+    }
+    // Repair indexes left behind by a removal.
+    if (orderIndex >= order.size())
+        orderIndex = 0;
+    current = static_cast<uint32_t>(order[orderIndex]);
+    if (current >= entries.size())
+        current = 0;
+    const TARN_MEDIA_INFO *entry = entries[current];
+    if (!entry) {
+        TLOG("URL_INFO at %d in list is NULL", static_cast<int>(current));
+        return -1;
+    }
+    if (out)
+        memcpy(out, entry, sizeof(TARN_MEDIA_INFO));
+    return 0;
+}
+
+int Playlist::GetCurrentUri(std::string &uri)
+{
+    if (GetCurrentSong(nullptr) != 0)
+        return -1;
+    uri = Field(entries[current]->path);
+    return 0;
+}
+
+int Playlist::GetCurrentInfoJson(Json::Value &info)
+{
+    if (current >= entries.size() || !entries[current]) {
+        TLOG("Bad current index [%u]", current);
+        return -1;
+    }
+    const TARN_MEDIA_INFO *entry = entries[current];
+    info["title"] = DisplayTitle(entry);
+    info["current"] = static_cast<int>(current);
+    info["artist"] = Field(entry->artist);
+    info["path"] = Field(entry->path);
+    return 0;
+}
+
+int Playlist::Next(std::string &uri, bool automatic)
+{
+    size_t n = order.size();
+    if (n == 0 || mode < 1) {
+        TLOG("Cannot step forward: %zu songs, mode [%d]", n, mode);
+        return -1;
+    }
+    if (mode == 1 || (mode == 2 && !automatic)) {
+        if (orderIndex + 1 >= n) {
+            TLOG("End of the playlist");
+            return -1;
+        }
+        ++orderIndex;
+    } else if (mode == 2) {
+        // The song ended by itself: play it again.
+        if (orderIndex >= n)
+            orderIndex = 0;
+    } else if (mode == 3) {
+        ++orderIndex;
+        if (orderIndex >= n)
+            orderIndex = 0;
+    } else {
+        TLOG("Invalid playlist mode [%d]", mode);
+        return -1;
+    }
+    return GetCurrentUri(uri);
+}
+
+int Playlist::Previous(std::string &uri, bool automatic)
+{
+    size_t n = order.size();
+    if (n == 0 || mode < 1) {
+        TLOG("Cannot step back: %zu songs, mode [%d]", n, mode);
+        return -1;
+    }
+    if (mode == 3) {
+        if (orderIndex == 0)
+            orderIndex = static_cast<uint32_t>(n - 1);
+        else
+            --orderIndex;
+    } else if (mode == 1 || (mode == 2 && !automatic)) {
+        if (orderIndex == 0) {
+            TLOG("Beginning of the playlist");
+            return -1;
+        }
+        --orderIndex;
+    } else if (mode == 2) {
+        if (orderIndex >= n)
+            orderIndex = 0;
+    } else {
+        TLOG("Invalid playlist mode [%d]", mode);
+        return -1;
+    }
+    return GetCurrentUri(uri);
+}
+
+int Playlist::ListJson(int start, int limit, Json::Value &reply)
+{
+    if (start < 0)
+        start = 0;
+    if (limit < 0)
+        limit = 20;
+    Json::Value uris(Json::arrayValue);
+    int64_t first = start;
+    int64_t end = static_cast<int64_t>(entries.size());
+    if (limit > 0)
+        end = std::min(end, first + limit);
+    for (int64_t i = first; i < end; ++i) {
+        const TARN_MEDIA_INFO *e = entries[static_cast<size_t>(i)];
+        if (!e)
+            continue;
+        Json::Value item(Json::objectValue);
+        char text[64];
+        snprintf(text, sizeof(text), "playing@%lu", static_cast<unsigned long>(e->id));
+        item["item_id"] = text;
+        item["album"] = Field(e->album);
+        item["artist"] = Field(e->artist);
+        item["albumArtURL"] = e->albumArtUrl[0] != '\0' ? Field(e->albumArtUrl) : std::string(kDefaultAlbumArt);
+        item["genre"] = Field(e->genre);
+        item["item_pid"] = "playing_root";
+        item["title"] = DisplayTitle(e);
+        item["bitrate"] = static_cast<Json::UInt>(e->bitrate);
+        item["duration"] = DurationSeconds(e->duration);
+        item["channels"] = static_cast<int>(e->channels);
+        item["res"] = Field(e->path);
+        item["sample"] = static_cast<int>(e->sample);
+        item["track"] = static_cast<int>(e->track);
+        item["disc"] = static_cast<int>(e->disc);
+        item["year"] = static_cast<int>(e->year);
+        snprintf(text, sizeof(text), "%llu", static_cast<unsigned long long>(e->size));
+        item["size"] = text;
+        item["sequence"] = static_cast<int>(i);
+        uris.append(item);
+    }
+    reply["uris"] = uris;
+    reply["total"] = static_cast<int>(entries.size());
+    reply["current"] = static_cast<Json::UInt>(current);
+    reply["mode"] = ModeName(mode);
+    reply["shuffle"] = shuffle;
+    reply["order_index"] = static_cast<Json::UInt>(orderIndex);
+    return 0;
+}
+
+int Playlist::HandleAction(const ControlRequest *request, Json::Value &reply)
+{
+    if (!request) {
+        TLOG("Bad parameter");
+        return -1;
+    }
+    // The request text, bounded by the parameter area.
+    std::string text(request->parameter, strnlen(request->parameter, sizeof(request->parameter)));
+    switch (request->action) {
+    case ACT_QUEUE_ADD: {
+        TARN_MEDIA_INFO info;
+        memcpy(&info, request->parameter, sizeof(info));
+        AddSong(&info);
+        break;
+    }
+    case ACT_QUEUE_REMOVE:
+        RemoveSong(static_cast<unsigned>(ParseDecimal(text)));
+        break;
+    case ACT_QUEUE_CLEAR:
+        Clear();
+        break;
+    case ACT_QUEUE_INSERT: {
+        TARN_MEDIA_INFO info;
+        memcpy(&info, request->parameter, sizeof(info));
+        int32_t index = 0;
+        memcpy(&index, reinterpret_cast<const char *>(request) + CTRL_INSERT_POS_OFFSET, sizeof(index));
+        InsertSong(static_cast<unsigned>(index), &info);
+        break;
+    }
+    case ACT_QUEUE_SET_CURRENT:
+        SetCurrent(static_cast<unsigned>(ParseDecimal(text)));
+        break;
+    case ACT_SET_REPEAT_MODE:
+        SetMode(ParseDecimal(text));
+        break;
+    case ACT_TOGGLE_SHUFFLE:
+        ToggleShuffle();
+        break;
+    case ACT_QUEUE_LIST: {
+        int start = 0;
+        int limit = 0;
+        sscanf(text.c_str(), "%d %d", &start, &limit);
+        ListJson(start, limit, reply);
+        break;
+    }
+    case ACT_CYCLE_REPEAT_MODE:
+        ToggleRepeatMode();
+        break;
+    default:
+        TLOG("Action [%d] not handled", request->action);
+        return -1;
+    }
+    return 0;
+}
