@@ -4,6 +4,7 @@
 
 #include <ctime>
 #include <string>
+#include <vector>
 
 #include <json/json.h>
 
@@ -40,11 +41,23 @@ public:
     unsigned GetState() const { return state; }
     int GetVolume() const { return volume; }
     int GetMplayerFd() const { return mplayerFd; }
+    int GetPosition() const { return position; }
+    const std::string &GetCurrentUri() const { return currentUri; }
+
+    // The "loadfile" command text for uri: backslashes doubled, double
+    // quotes passed through as they are.
+    static std::string LoadFileCommand(const std::string &uri);
+    // The argument vector of the last mplayer-daemon started (argv[0] first).
+    const std::vector<std::string> &LastStartArgs() const { return lastArgs; }
 
 private:
     int StartMplayer(const std::string &uri);
     int LoadFile(const std::string &uri);
     int SendCommand(const char *bytes, size_t length);
+    // Sends text in a NUL-padded 2048-byte buffer.
+    int SendPadded(const char *text);
+    // Next (forward) or Previous, skipping songs the player cannot play.
+    int Step(bool forward, bool automatic);
     bool IsMplayerAlive();
     void KillMplayer();
     void CloseMplayerFd();
@@ -59,6 +72,7 @@ private:
     std::string radioStation;
     time_t lastVolumeCheck;
     int32_t volume;
+    std::vector<std::string> lastArgs;
 };
 
 #endif
