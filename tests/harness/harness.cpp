@@ -1,0 +1,688 @@
+#include "tests/harness/harness.h"
+
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <dirent.h>
+#include <fcntl.h>
+#include <ftw.h>
+#include <poll.h>
+#include <sys/ipc.h>
+#include <sys/prctl.h>
+#include <sys/shm.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "platform/tarn_env.h"
+#include "platform/tlibc_proc.h"
+
+namespace tarntest {
+
+namespace {
+
+std::string g_processRoot;
+
+long NowMs()
+{
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return ts.tv_sec * 1000L + ts.tv_nsec / 1000000L;
+}
+
+void SleepMs(int ms)
+{
+    usleep(static_cast<useconds_t>(ms) * 1000);
+}
+
+int RemoveEntry(const char *path, const struct stat *, int, struct FTW *)
+{
+    remove(path);
+    return 0;
+}
+
+// Empties a directory tree (the directory itself stays).
+void EmptyDir(const std::string &dir)
+{
+    DIR *d = opendir(dir.c_str());
+    if (!d)
+        return;
+    std::vector<std::string> names;
+    while (struct dirent *e = readdir(d)) {
+        if (strcmp(e->d_name, ".") && strcmp(e->d_name, ".."))
+            names.push_back(dir + "/" + e->d_name);
+    }
+    closedir(d);
+    for (const std::string &n : names)
+        nftw(n.c_str(), RemoveEntry, 16, FTW_DEPTH | FTW_PHYS);
+}
+
+void RemoveProcessRoot()
+{
+    if (g_processRoot.empty())
+        return;
+    EmptyDir(g_processRoot);
+    rmdir(g_processRoot.c_str());
+}
+
+int MakeDirs(const std::string &path)
+{
+    std::string cur;
+    size_t pos = 0;
+    while (pos != std::string::npos) {
+        pos = path.find('/', pos + 1);
+        cur = path.substr(0, pos);
+        if (!cur.empty() && mkdir(cur.c_str(), 0755) != 0 && errno != EEXIST)
+            return -1;
+    }
+    return 0;
+}
+
+int CopyFile(const std::string &from, const std::string &to, mode_t mode)
+{
+    int in = open(from.c_str(), O_RDONLY | O_CLOEXEC);
+    if (in < 0)
+        return -1;
+    int out = open(to.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
+    if (out < 0) {
+        close(in);
+        return -1;
+    }
+    char buf[65536];
+    ssize_t n;
+    int rc = 0;
+    while ((n = read(in, buf, sizeof(buf))) > 0) {
+        if (write(out, buf, static_cast<size_t>(n)) != n) {
+            rc = -1;
+            break;
+        }
+    }
+    if (n < 0)
+        rc = -1;
+    close(in);
+    if (close(out) != 0)
+        rc = -1;
+    return rc;
+}
+
+std::string ReadAll(const std::string &path)
+{
+    std::string out;
+    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0)
+        return out;
+    char buf[65536];
+    ssize_t n;
+    while ((n = read(fd, buf, sizeof(buf))) > 0)
+        out.append(buf, static_cast<size_t>(n));
+    close(fd);
+    return out;
+}
+
+void RemoveSegment(int key)
+{
+    int id = shmget(key, 0, 0);
+    if (id >= 0)
+        shmctl(id, IPC_RMID, nullptr);
+}
+
+void *AttachSegment(int key, size_t size, bool readOnly)
+{
+    int id = shmget(key, size, 0);
+    if (id < 0)
+        return nullptr;
+    void *p = shmat(id, nullptr, readOnly ? SHM_RDONLY : 0);
+    return p == reinterpret_cast<void *>(-1) ? nullptr : p;
+}
+
+}  // namespace
+
+bool InPrivateNetns()
+{
+    char self[128] = {0};
+    char init[128] = {0};
+    ssize_t a = readlink("/proc/self/ns/net", self, sizeof(self) - 1);
+    ssize_t b = readlink("/proc/1/ns/net", init, sizeof(init) - 1);
+    if (a > 0 && b > 0)
+        return strcmp(self, init) != 0;
+    return TarnEnvGet("TARN_IN_NETNS") == "1";
+}
+
+std::string BinPath(const char *name)
+{
+    return std::string(TARN_BIN_DIR) + "/" + name;
+}
+
+std::string SourcePath(const char *relative)
+{
+    return std::string(TARN_SOURCE_DIR) + "/" + relative;
+}
+
+TARN_MEDIA_INFO MakeMediaInfo(const std::string &path, const std::string &title,
+                              const std::string &artist, float duration)
+{
+    TARN_MEDIA_INFO info;
+    memset(&info, 0, sizeof(info));
+    snprintf(info.path, sizeof(info.path), "%s", path.c_str());
+    std::string t = title;
+    if (t.empty()) {
+        size_t slash = path.rfind('/');
+        t = slash == std::string::npos ? path : path.substr(slash + 1);
+        size_t dot = t.rfind('.');
+        if (dot != std::string::npos && dot > 0)
+            t = t.substr(0, dot);
+    }
+    snprintf(info.title, sizeof(info.title), "%s", t.c_str());
+    snprintf(info.artist, sizeof(info.artist), "%s", artist.c_str());
+    info.duration = duration;
+    return info;
+}
+
+ControlRequest MakeRequest(int action, const char *param)
+{
+    ControlRequest req;
+    memset(&req, 0, sizeof(req));
+    req.action = action;
+    if (param)
+        snprintf(req.parameter, sizeof(req.parameter), "%s", param);
+    return req;
+}
+
+int CountFds(pid_t pid)
+{
+    char path[64];
+    snprintf(path, sizeof(path), "/proc/%d/fd", static_cast<int>(pid));
+    DIR *d = opendir(path);
+    if (!d)
+        return -1;
+    int n = 0;
+    while (struct dirent *e = readdir(d)) {
+        if (e->d_name[0] != '.')
+            ++n;
+    }
+    closedir(d);
+    return n;
+}
+
+// ---------------------------------------------------------------------------
+
+Harness::Harness(bool freshSegments)
+{
+    prctl(PR_SET_CHILD_SUBREAPER, 1, 0, 0, 0);
+    if (g_processRoot.empty()) {
+        char tmpl[] = "/tmp/tarnroot.XXXXXX";
+        if (!mkdtemp(tmpl)) {
+            error = std::string("mkdtemp failed: ") + strerror(errno);
+            return;
+        }
+        g_processRoot = tmpl;
+        atexit(RemoveProcessRoot);
+        char key[32];
+        // Distinct per test process; keys stay clear of the appliance's own.
+        snprintf(key, sizeof(key), "%d", 0x30000000 + (static_cast<int>(getpid()) % 0x100000) * 4);
+        setenv("TARN_ROOT", g_processRoot.c_str(), 1);
+        setenv("TARN_SHM_KEY", key, 1);
+        setenv("TARN_LOG_FILE", (g_processRoot + "/log.txt").c_str(), 1);
+        if (TarnEnvGet("TARN_AUDIO_OUT").empty())
+            setenv("TARN_AUDIO_OUT", "null", 1);
+    }
+    root = g_processRoot;
+    if (TarnRoot() != root)
+        error = "TARN_ROOT was read before the harness set it";
+    PrepareRoot();
+    if (freshSegments)
+        RemoveSegments();
+}
+
+Harness::~Harness()
+{
+    if (daemonPid > 0)
+        Stop();
+    // Whatever the daemon started under this root (mplayer-daemon) ends too.
+    TLIBCKill("mplayer-daemon", SIGKILL);
+    WaitAllChildren(3000);
+    DetachSegments();
+    RemoveSegments();
+}
+
+void Harness::PrepareRoot()
+{
+    if (root.empty())
+        return;
+    EmptyDir(root);
+    static const char *dirs[] = {"/tmp", "/var/run", "/etc", "/usr/tarn/bin", "/usr/tarn/etc/audio",
+                                 "/usr/tarn/etc.defaults/audio"};
+    for (const char *d : dirs)
+        MakeDirs(root + d);
+    std::string mplayer = BinPath("mplayer-daemon");
+    if (access(mplayer.c_str(), X_OK) == 0)
+        CopyFile(mplayer, Path(TARN_MPLAYER_BIN), 0755);
+}
+
+std::string Harness::Path(const char *fixedPath) const
+{
+    return root + fixedPath;
+}
+
+int Harness::WriteFile(const char *fixedPath, const std::string &content) const
+{
+    std::string p = Path(fixedPath);
+    size_t slash = p.rfind('/');
+    if (slash != std::string::npos && MakeDirs(p.substr(0, slash)) != 0)
+        return -1;
+    int fd = open(p.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    if (fd < 0)
+        return -1;
+    ssize_t w = write(fd, content.data(), content.size());
+    close(fd);
+    return w == static_cast<ssize_t>(content.size()) ? 0 : -1;
+}
+
+std::string Harness::ReadFile(const char *fixedPath) const
+{
+    return ReadAll(Path(fixedPath));
+}
+
+bool Harness::Exists(const char *fixedPath) const
+{
+    struct stat st;
+    return lstat(Path(fixedPath).c_str(), &st) == 0;
+}
+
+// ---- processes -------------------------------------------------------------
+
+void Harness::Reap()
+{
+    for (;;) {
+        int status = 0;
+        pid_t p = waitpid(-1, &status, WNOHANG);
+        if (p <= 0)
+            break;
+        reaped[p] = status;
+    }
+}
+
+int Harness::WaitExit(pid_t pid, int timeoutMs)
+{
+    long end = NowMs() + timeoutMs;
+    for (;;) {
+        Reap();
+        auto it = reaped.find(pid);
+        if (it != reaped.end()) {
+            int st = it->second;
+            if (WIFEXITED(st))
+                return WEXITSTATUS(st);
+            return -2;
+        }
+        if (NowMs() >= end)
+            return -1;
+        SleepMs(5);
+    }
+}
+
+int Harness::WaitAllChildren(int timeoutMs)
+{
+    long end = NowMs() + timeoutMs;
+    for (;;) {
+        int status = 0;
+        pid_t p = waitpid(-1, &status, WNOHANG);
+        if (p > 0) {
+            reaped[p] = status;
+            continue;
+        }
+        if (p < 0 && errno == ECHILD)
+            return 0;
+        if (NowMs() >= end)
+            return -1;
+        SleepMs(5);
+    }
+}
+
+pid_t Harness::Spawn(const std::vector<std::string> &argv, bool quiet)
+{
+    if (!InPrivateNetns()) {
+        error = "refusing to start programs outside a private network namespace "
+                "(run under scripts/netns-run)";
+        return -1;
+    }
+    if (argv.empty())
+        return -1;
+    std::vector<char *> args;
+    for (const std::string &a : argv)
+        args.push_back(const_cast<char *>(a.c_str()));
+    args.push_back(nullptr);
+    pid_t pid = fork();
+    if (pid < 0)
+        return -1;
+    if (pid == 0) {
+        if (quiet) {
+            int devnull = open("/dev/null", O_RDWR);
+            if (devnull >= 0) {
+                dup2(devnull, 1);
+                dup2(devnull, 2);
+            }
+        }
+        execv(args[0], args.data());
+        _exit(127);
+    }
+    return pid;
+}
+
+int Harness::Run(const std::vector<std::string> &argv, std::string *out, int timeoutMs)
+{
+    if (!InPrivateNetns()) {
+        error = "refusing to start programs outside a private network namespace "
+                "(run under scripts/netns-run)";
+        return -1;
+    }
+    if (argv.empty())
+        return -1;
+    int fds[2];
+    if (pipe2(fds, O_CLOEXEC) != 0)
+        return -1;
+    std::vector<char *> args;
+    for (const std::string &a : argv)
+        args.push_back(const_cast<char *>(a.c_str()));
+    args.push_back(nullptr);
+    pid_t pid = fork();
+    if (pid < 0) {
+        close(fds[0]);
+        close(fds[1]);
+        return -1;
+    }
+    if (pid == 0) {
+        dup2(fds[1], 1);
+        dup2(fds[1], 2);
+        execv(args[0], args.data());
+        _exit(127);
+    }
+    close(fds[1]);
+    std::string text;
+    long end = NowMs() + timeoutMs;
+    // Read until the program and every process that inherited its output
+    // (a daemonizing child sends its streams to /dev/null) closed the pipe.
+    for (;;) {
+        long left = end - NowMs();
+        if (left <= 0)
+            break;
+        struct pollfd p = {fds[0], POLLIN, 0};
+        int r = poll(&p, 1, static_cast<int>(left));
+        if (r < 0 && errno == EINTR)
+            continue;
+        if (r <= 0)
+            break;
+        char buf[4096];
+        ssize_t n = read(fds[0], buf, sizeof(buf));
+        if (n <= 0)
+            break;
+        text.append(buf, static_cast<size_t>(n));
+    }
+    close(fds[0]);
+    if (out)
+        *out = text;
+    int rc = WaitExit(pid, static_cast<int>(end - NowMs() > 0 ? end - NowMs() : 0));
+    if (rc == -1) {
+        kill(pid, SIGKILL);
+        WaitExit(pid, 2000);
+        error = "program did not end in time: " + argv[0];
+        return -1;
+    }
+    return rc == -2 ? -1 : rc;
+}
+
+int Harness::Launch(std::string *out, int timeoutMs)
+{
+    return Run({BinPath("tarnaudiod")}, out, timeoutMs);
+}
+
+int Harness::PidFromFile() const
+{
+    return TLIBCReadPidFile(Path(TARN_PID_FILE).c_str());
+}
+
+int Harness::Start(int timeoutMs)
+{
+    if (!error.empty() && error.find("TARN_ROOT") != std::string::npos)
+        return -1;
+    if (daemonPid > 0) {
+        error = "daemon already started by this harness";
+        return -1;
+    }
+    long end = NowMs() + timeoutMs;
+    std::string out;
+    int rc = Launch(&out, timeoutMs);
+    if (rc != 0) {
+        error = "tarnaudiod exited with " + std::to_string(rc) + ": " + out + " " + error;
+        return -1;
+    }
+    for (;;) {
+        int pid = PidFromFile();
+        if (pid > 0 && TLIBCProcAlive(pid) && Exists(TARN_CTRL_SOCKET)) {
+            daemonPid = pid;
+            return 0;
+        }
+        Reap();
+        if (NowMs() >= end) {
+            error = "tarnaudiod did not become ready (pid file " + std::to_string(pid) +
+                    "); log:\n" + Log();
+            return -1;
+        }
+        SleepMs(5);
+    }
+}
+
+int Harness::Stop(int timeoutMs)
+{
+    if (daemonPid <= 0)
+        return -1;
+    pid_t pid = daemonPid;
+    daemonPid = 0;
+    if (kill(pid, SIGTERM) != 0)
+        return WaitExit(pid, 1000);
+    int rc = WaitExit(pid, timeoutMs);
+    if (rc == -1) {
+        error = "tarnaudiod did not end after SIGTERM; killed";
+        kill(pid, SIGKILL);
+        WaitExit(pid, 2000);
+        return -1;
+    }
+    return rc;
+}
+
+// ---- control requests --------------------------------------------------------
+
+int Harness::Connect() const
+{
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0)
+        return -1;
+    struct sockaddr_un addr;
+    memset(&addr, 0, sizeof(addr));
+    addr.sun_family = AF_UNIX;
+    snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", Path(TARN_CTRL_SOCKET).c_str());
+    if (connect(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) != 0) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+int Harness::SendBytes(const void *bytes, size_t length, std::string *reply, int timeoutMs,
+                       size_t *received)
+{
+    if (received)
+        *received = 0;
+    if (reply)
+        reply->clear();
+    int fd = Connect();
+    if (fd < 0) {
+        error = "cannot connect to " + Path(TARN_CTRL_SOCKET) + ": " + strerror(errno);
+        return -1;
+    }
+    if (length > 0 && write(fd, bytes, length) != static_cast<ssize_t>(length)) {
+        error = std::string("write failed: ") + strerror(errno);
+        close(fd);
+        return -1;
+    }
+    std::string data;
+    long end = NowMs() + timeoutMs;
+    for (;;) {
+        long left = end - NowMs();
+        if (left <= 0)
+            break;
+        struct pollfd p = {fd, POLLIN, 0};
+        int r = poll(&p, 1, static_cast<int>(left));
+        if (r < 0 && errno == EINTR)
+            continue;
+        if (r <= 0)
+            break;
+        char buf[8192];
+        ssize_t n = read(fd, buf, sizeof(buf));
+        if (n <= 0)
+            break;
+        data.append(buf, static_cast<size_t>(n));
+    }
+    close(fd);
+    if (received)
+        *received = data.size();
+    if (data.empty()) {
+        error = "no reply";
+        return -1;
+    }
+    if (reply)
+        *reply = std::string(data.c_str());
+    return 0;
+}
+
+int Harness::RequestRaw(const ControlRequest &request, std::string *reply, int timeoutMs)
+{
+    return SendBytes(&request, sizeof(request), reply, timeoutMs);
+}
+
+int Harness::Request(int action, const char *param, std::string *reply, int timeoutMs)
+{
+    ControlRequest req = MakeRequest(action, param);
+    return RequestRaw(req, reply, timeoutMs);
+}
+
+int Harness::QueueAdd(const TARN_MEDIA_INFO &info)
+{
+    ControlRequest req = MakeRequest(ACT_QUEUE_ADD);
+    memcpy(req.parameter, &info, sizeof(info));
+    return RequestRaw(req, nullptr);
+}
+
+int Harness::QueueInsert(const TARN_MEDIA_INFO &info, int position)
+{
+    ControlRequest req = MakeRequest(ACT_QUEUE_INSERT);
+    memcpy(req.parameter, &info, sizeof(info));
+    int32_t pos = position;
+    memcpy(reinterpret_cast<char *>(&req) + CTRL_INSERT_POS_OFFSET, &pos, sizeof(pos));
+    return RequestRaw(req, nullptr);
+}
+
+// ---- log ---------------------------------------------------------------------
+
+std::string Harness::Log() const
+{
+    return ReadAll(root + "/log.txt");
+}
+
+int Harness::CountLog(const std::string &needle) const
+{
+    std::string log = Log();
+    int n = 0;
+    for (size_t pos = log.find(needle); pos != std::string::npos; pos = log.find(needle, pos + 1))
+        ++n;
+    return n;
+}
+
+bool Harness::WaitLog(const std::string &needle, int timeoutMs) const
+{
+    long end = NowMs() + timeoutMs;
+    for (;;) {
+        if (CountLog(needle) > 0)
+            return true;
+        if (NowMs() >= end)
+            return false;
+        SleepMs(10);
+    }
+}
+
+void Harness::ClearLog() const
+{
+    truncate((root + "/log.txt").c_str(), 0);
+}
+
+// ---- segments ----------------------------------------------------------------
+
+int Harness::PlayerKey() const
+{
+    return TarnShmKeyPlayer();
+}
+
+int Harness::PublishedKey() const
+{
+    return TarnShmKeyPublished();
+}
+
+const PlayerStatusShm *Harness::PlayerSegment()
+{
+    if (!playerRo) {
+        playerRo = static_cast<PlayerStatusShm *>(
+            AttachSegment(PlayerKey(), TARN_SHM_PLAYER_SIZE, true));
+        if (playerRo)
+            attachments.push_back(playerRo);
+    }
+    return playerRo;
+}
+
+const PublishedStatusShm *Harness::PublishedSegment()
+{
+    if (!publishedRo) {
+        publishedRo = static_cast<PublishedStatusShm *>(
+            AttachSegment(PublishedKey(), TARN_SHM_PUBLISHED_SIZE, true));
+        if (publishedRo)
+            attachments.push_back(publishedRo);
+    }
+    return publishedRo;
+}
+
+PlayerStatusShm *Harness::PlayerSegmentWritable()
+{
+    if (!playerRw) {
+        playerRw = static_cast<PlayerStatusShm *>(
+            AttachSegment(PlayerKey(), TARN_SHM_PLAYER_SIZE, false));
+        if (playerRw)
+            attachments.push_back(playerRw);
+    }
+    return playerRw;
+}
+
+void Harness::DetachSegments()
+{
+    for (void *p : attachments)
+        shmdt(p);
+    attachments.clear();
+    playerRo = nullptr;
+    publishedRo = nullptr;
+    playerRw = nullptr;
+}
+
+void Harness::RemoveSegments()
+{
+    RemoveSegment(PlayerKey());
+    RemoveSegment(PublishedKey());
+}
+
+int Harness::CreateSegment(int key, size_t size)
+{
+    return shmget(key, size, IPC_CREAT | IPC_EXCL | 0666) >= 0 ? 0 : -1;
+}
+
+}  // namespace tarntest
