@@ -8,7 +8,8 @@
 // The extension the indexer knows the file by: the text after the last dot
 // of the file name, matched without regard to case against the playable
 // types ("mp3", "m4a", "ogg", "aac", "wma", "flac", "aiff", "aif", "mp1",
-// "mp2", "mpa", "wav", "ac3", "ra", "ram", "m4p", "m4b", "ape") and "txt".
+// "mp2", "mpa", "wav", "ac3", "ra", "ram", "m4p", "m4b", "ape"), the other
+// types the media library indexes ("oga", "opus", "mpc", "wv") and "txt".
 // Returns the lower-case extension (a static text, never freed), or null
 // when the path is null, has no extension or one the indexer does not know.
 const char *TARNIndexExtGet(const char *path);

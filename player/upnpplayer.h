@@ -44,6 +44,7 @@ private:
     int PlayIndex(const char *text);
     int Seek(const char *text);
     int GetStatusJson(Json::Value &reply);
+    RENDERER_INFO *WaitUnlocked(int milliseconds);
 
     int32_t state;
     Playlist *playlist;
