@@ -4,12 +4,13 @@
 #define TARN_UPNP_H
 
 #include <pthread.h>
+#include <atomic>
 #include <cstdint>
 #include <string>
 #include <vector>
 
 #include <json/json.h>
-#include <upnp/upnp.h>
+#include "upnp/upnp_sdk.h"
 
 struct SERVER_INFO {
     std::string udn;
@@ -84,11 +85,31 @@ public:
     unsigned RendererCount() const { return static_cast<unsigned>(renderers.size()); }
     unsigned ServerCount() const { return static_cast<unsigned>(servers.size()); }
 
+    // Location URL -> host and port text ("80" when the URL has none).
+    static int ParseHttpUrl(const std::string &location, std::string &ip, std::string &port);
+    // A service URL of the description resolved against base; "" on failure.
+    static std::string ResolveUrl(const std::string &base, const std::string &relative);
+
 private:
     // Discovery, removal, answers and events: see upnp.cpp.
     friend struct UpnpControllerAccess;  // unit tests of the list rules
 
-    uint32_t current;
+    int OnDiscovery(const UpnpDiscovery *event);
+    void AddServer(IXML_Document *doc, const char *location);
+    void AddRenderer(IXML_Document *doc, const char *location);
+    int OnByeBye(const UpnpDiscovery *event);
+    int RemoveServer(unsigned index);
+    int RemoveRenderer(unsigned index);
+    int OnActionComplete(const UpnpActionComplete *event);
+    static int UpdatePositionInfo(IXML_Element *response, RENDERER_INFO *renderer);
+    static int UpdateTransportInfo(IXML_Element *response, RENDERER_INFO *renderer);
+    int OnSubscription(const UpnpEventSubscribe *event);
+    int OnEventReceived(const UpnpEvent *event);
+    static int UpdateFromLastChange(RENDERER_INFO *renderer, const UpnpEvent *event);
+
+    // Written by the request handler (selection) and by libupnp threads
+    // (removal of a renderer), read by the main loop's turn.
+    std::atomic<uint32_t> current;
     std::vector<RENDERER_INFO *> renderers;
     std::vector<SERVER_INFO *> servers;
     UpnpClient_Handle client_handle;
