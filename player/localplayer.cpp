@@ -12,17 +12,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
-#if __has_include("audio/info.h")
 #include "audio/info.h"
-#else
-// Audio settings of the appliance (audio/info.cpp).
-int EqDefaultProfileGet(char *out, size_t size);
-int MixerGetVolume();
-int MixerSetVolumeAll(int volume);
-int VolumeConfGet();
-int VolumeConfSet(int volume);
-int AudioIsSupportedFile(int mode, const char *path);
-#endif
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_proc.h"
@@ -266,15 +256,16 @@ int LocalPlayer::StartMplayer(const std::string &uri)
         if (*p == ' ')
             *p = ':';
     }
-    char filter[256];
-    snprintf(filter, sizeof(filter), "equalizer=%s", gains);
+    // The filter argument holds at most 255 characters.
+    std::string filter = std::string("equalizer=") + gains;
+    if (filter.size() > 255)
+        filter.resize(255);
     char volumeText[16];
     snprintf(volumeText, sizeof(volumeText), "%d", volume);
 
     std::string exe = TarnPath(TARN_MPLAYER_BIN);
     std::vector<std::string> args = {exe, uri, "-loop", "0", "-daemon", "-volume", volumeText,
                                      "-af", filter};
-    lastArgs = args;
     std::vector<char *> argv;
     for (std::string &a : args)
         argv.push_back(&a[0]);

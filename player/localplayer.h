@@ -47,8 +47,6 @@ public:
     // The "loadfile" command text for uri: backslashes doubled, double
     // quotes passed through as they are.
     static std::string LoadFileCommand(const std::string &uri);
-    // The argument vector of the last mplayer-daemon started (argv[0] first).
-    const std::vector<std::string> &LastStartArgs() const { return lastArgs; }
 
 private:
     int StartMplayer(const std::string &uri);
@@ -72,7 +70,6 @@ private:
     std::string radioStation;
     time_t lastVolumeCheck;
     int32_t volume;
-    std::vector<std::string> lastArgs;
 };
 
 #endif
