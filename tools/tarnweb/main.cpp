@@ -1,0 +1,147 @@
+// tarnweb: serves the songs that the daemon hands to UPnP renderers.
+//
+//   tarnweb [--port N] [--bind ADDR] [--threads N] [--db FILE]
+//           [--usb-root DIR] [--write-timeout SEC] [--verbose]
+//
+// The port defaults to "admin_port" of /etc/tarninfo.conf, the port the
+// daemon writes into its song URLs. "--port 0" takes any free port. Once
+// listening it prints "tarnweb: listening on ADDR:PORT" on standard output.
+// SIGTERM or SIGINT stop it.
+#include <signal.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <thread>
+
+#include "daemon/tarn_types.h"
+#include "platform/tarn_env.h"
+#include "platform/tarn_log.h"
+#include "platform/tlibc_conf.h"
+#include "tools/tarnweb/song_server.h"
+
+namespace {
+
+void Usage(FILE *out)
+{
+    fprintf(out,
+            "usage: tarnweb [--port N] [--bind ADDR] [--threads N] [--db FILE]\n"
+            "               [--usb-root DIR] [--write-timeout SEC] [--verbose]\n"
+            "  --port N          port to listen on (default: admin_port of %s; 0: any)\n"
+            "  --bind ADDR       address to listen on (default 0.0.0.0)\n"
+            "  --threads N       connections served at once (default 8)\n"
+            "  --db FILE         media library database (default %s)\n"
+            "  --usb-root DIR    only files below DIR are served by path\n"
+            "                    (default: usb_mount_root of the configuration, or /media/usb)\n"
+            "  --write-timeout S drop a client that takes nothing for S seconds (default 60)\n"
+            "  --verbose         one line per request on standard error\n",
+            TarnPath(TARN_INFO_CONF).c_str(), "/usr/tarn/var/medialib.db");
+}
+
+bool ParseInt(const char *text, int low, int high, int *out)
+{
+    char *end = nullptr;
+    long v = strtol(text, &end, 10);
+    if (!*text || *end || v < low || v > high)
+        return false;
+    *out = static_cast<int>(v);
+    return true;
+}
+
+}  // namespace
+
+int main(int argc, char **argv)
+{
+    TarnLogOpen("tarnweb");
+    SongServerOptions options;
+    bool portGiven = false;
+    for (int i = 1; i < argc; ++i) {
+        std::string a = argv[i];
+        const char *value = i + 1 < argc ? argv[i + 1] : nullptr;
+        bool ok = true;
+        if (a == "--help" || a == "-h") {
+            Usage(stdout);
+            return 0;
+        } else if (a == "--verbose") {
+            options.verbose = true;
+            continue;
+        } else if (!value) {
+            fprintf(stderr, "tarnweb: %s needs a value (see --help)\n", a.c_str());
+            return 2;
+        } else if (a == "--port") {
+            ok = ParseInt(value, 0, 65535, &options.port);
+            portGiven = ok;
+        } else if (a == "--bind") {
+            options.bindAddress = value;
+        } else if (a == "--threads") {
+            ok = ParseInt(value, 1, 256, &options.threads);
+        } else if (a == "--write-timeout") {
+            ok = ParseInt(value, 1, 3600, &options.writeTimeoutSec);
+        } else if (a == "--db") {
+            options.dbPath = value;
+        } else if (a == "--usb-root") {
+            options.usbRoot = value;
+        } else {
+            fprintf(stderr, "tarnweb: unknown option %s (see --help)\n", a.c_str());
+            return 2;
+        }
+        if (!ok) {
+            fprintf(stderr, "tarnweb: bad value [%s] for %s\n", value, a.c_str());
+            return 2;
+        }
+        ++i;
+    }
+    if (!portGiven) {
+        std::string conf = TarnPath(TARN_INFO_CONF);
+        char port[16] = "";
+        if (TLIBCFileGetKeyValue(conf.c_str(), "admin_port", port, sizeof(port), 0) <= 0 ||
+            !ParseInt(port, 1, 65535, &options.port)) {
+            fprintf(stderr, "tarnweb: no port: set admin_port in %s or pass --port\n", conf.c_str());
+            return 2;
+        }
+    }
+
+    // Signals are taken by one thread; the server threads never see them.
+    sigset_t stopSignals;
+    sigemptyset(&stopSignals);
+    sigaddset(&stopSignals, SIGTERM);
+    sigaddset(&stopSignals, SIGINT);
+    pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+
+    SongServer server(options);
+    int port = server.Bind();
+    if (port <= 0) {
+        fprintf(stderr, "tarnweb: cannot listen on %s:%d (in use, or not an address of this machine)\n",
+                options.bindAddress.c_str(), options.port);
+        TarnLog("%s:%d Cannot listen on %s:%d", "tarnweb", __LINE__, options.bindAddress.c_str(),
+                options.port);
+        return 1;
+    }
+    printf("tarnweb: listening on %s:%d\n", options.bindAddress.c_str(), port);
+    fflush(stdout);
+
+    std::atomic<bool> served(false);
+    std::thread waiter([&server, &served, stopSignals] {
+        int sig = 0;
+        sigwait(&stopSignals, &sig);
+        // Repeated: a signal that comes before the server loop has started
+        // would otherwise be lost.
+        while (!served.load()) {
+            server.Stop();
+            usleep(50 * 1000);
+        }
+    });
+    int r = server.Serve();
+    served.store(true);
+    if (r != 0) {
+        fprintf(stderr, "tarnweb: listening failed\n");
+        // Wake the signal thread so that it can be joined.
+        kill(getpid(), SIGTERM);
+    }
+    waiter.join();
+    return r == 0 ? 0 : 1;
+}

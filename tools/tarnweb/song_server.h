@@ -1,0 +1,72 @@
+// The song server: answers the audiotransfer.cgi URLs that the renderer
+// player hands to renderers.
+//
+//   GET|HEAD /audio/webUI/audiotransfer.cgi/<token>.<ext>
+//       <token> is the song-id token (platform/media_id.h); the song's file
+//       is looked up in the media library by id.
+//   GET|HEAD /audio/webUI/audiotransfer.cgi/ipod/<hex path>.<ext>
+//       <hex path> is the file path, two hex digits per byte; only regular
+//       files below the USB mount root (after resolving links) are served.
+//
+// Files are streamed from disk in chunks, with byte ranges (206, and 416 for
+// a range past the end), the type's MIME type and the DLNA streaming headers.
+#ifndef TARNWEB_SONG_SERVER_H
+#define TARNWEB_SONG_SERVER_H
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <string>
+
+namespace httplib {
+class Server;
+struct Request;
+struct Response;
+}
+class MediaLib;
+
+struct SongServerOptions {
+    std::string bindAddress = "0.0.0.0";
+    int port = 0;              // 0: any free port
+    int threads = 8;           // worker threads (connections served at once)
+    int writeTimeoutSec = 60;  // a client that reads nothing for this long is dropped
+    std::string dbPath;        // media library database
+    std::string usbRoot;       // "" -> TARNAudioUSBMountRoot()
+    bool verbose = false;      // one line per request on stderr
+};
+
+class SongServer {
+public:
+    explicit SongServer(const SongServerOptions &options);
+    ~SongServer();
+    SongServer(const SongServer &) = delete;
+    SongServer &operator=(const SongServer &) = delete;
+
+    // Binds the listening socket; returns the port, or -1.
+    int Bind();
+    // Serves until Stop(); 0 when stopped, -1 on a listening error.
+    int Serve();
+    void Stop();
+
+private:
+    int LookupSong(uint32_t id, std::string *path);
+    void ServeFile(const httplib::Request &req, httplib::Response &res, const std::string &path,
+                   const std::string &urlExt, bool usb);
+
+    SongServerOptions options;
+    std::unique_ptr<httplib::Server> server;
+    std::mutex libraryMutex;
+    std::unique_ptr<MediaLib> library;
+};
+
+// Decodes the hex text of a path (two digits per byte). 0, or -1 for an odd
+// length, a non-hex digit or a NUL byte.
+int SongServerDecodeHex(const std::string &hex, std::string *out);
+
+// Resolves path (links included) and checks that it lies inside root (also
+// resolved). 0 with the resolved path, -1 when it does not exist, has a ".."
+// component or lies outside root.
+int SongServerResolveInside(const std::string &path, const std::string &root,
+                            std::string *resolved);
+
+#endif
