@@ -1,1 +1,7 @@
-int main() { return 0; }
+// tarnaudiod: the audio playback daemon. Arguments are ignored.
+#include "daemon/tarnaudiod.h"
+
+int main()
+{
+    return DaemonRun();
+}

@@ -1,0 +1,14 @@
+// Server side of the local Unix-domain stream sockets.
+#ifndef TARN_SOCKET_H
+#define TARN_SOCKET_H
+
+// Binds a listening stream socket at `path` (a file left there by an earlier
+// run is unlinked first; paths longer than 107 characters are cut). Returns
+// the descriptor (blocking mode) or -1.
+int SocketListen(const char *path, int backlog);
+
+// Accepts a pending connection on the listening descriptor `fd` without
+// waiting. Returns the connection, or -1 at once when none is pending.
+int SocketAcceptPoll(int fd);
+
+#endif

@@ -1,0 +1,455 @@
+#include "daemon/tarnaudiod.h"
+
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <fcntl.h>
+#include <string>
+#include <sys/select.h>
+#include <unistd.h>
+
+#include "daemon/globals.h"
+#include "daemon/shm.h"
+#include "daemon/socket.h"
+#include "platform/tarn_env.h"
+#include "platform/tarn_log.h"
+#include "platform/tlibc_proc.h"
+#include "player/localplayer.h"
+#include "player/upnpplayer.h"
+#include "source/changesrc.h"
+#include "upnp/upnp.h"
+
+static const char kLogUnit[] = "tarnaudiod";
+
+namespace {
+
+// How long the handler waits for a request and for the client to take the
+// reply.
+const long long kWaitUs = 500000;
+
+long long NowUs()
+{
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return ts.tv_sec * 1000000LL + ts.tv_nsec / 1000;
+}
+
+// Waits at most 0.5 s for fd to become readable (or writable). A signal that
+// interrupts select (SIGTERM arriving while a client is being served) does
+// not end the wait early: it goes on for the time that is left, so that the
+// request in flight is still answered. 1 ready, 0 not ready or error.
+int WaitFd(int fd, bool forWrite)
+{
+    if (fd < 0 || fd >= FD_SETSIZE)
+        return 0;
+    long long end = NowUs() + kWaitUs;
+    for (;;) {
+        long long left = end - NowUs();
+        if (left < 0)
+            left = 0;
+        fd_set set;
+        FD_ZERO(&set);
+        FD_SET(fd, &set);
+        struct timeval tv = {static_cast<time_t>(left / 1000000),
+                             static_cast<suseconds_t>(left % 1000000)};
+        int r = forWrite ? select(fd + 1, nullptr, &set, nullptr, &tv)
+                         : select(fd + 1, &set, nullptr, nullptr, &tv);
+        if (r > 0)
+            return FD_ISSET(fd, &set) ? 1 : 0;
+        if (r == 0 || errno != EINTR || left == 0)
+            return 0;
+    }
+}
+
+// The request as read, followed by a NUL so that a parameter text without
+// its own terminator still ends inside our buffer.
+struct GuardedRequest {
+    ControlRequest request;
+    char terminator[4];
+};
+
+int ChangeSource(int action, const char *parameter, LocalPlayer *player)
+{
+    switch (action) {
+    case ACT_SOURCE_RANDOM:
+        return ChangeSourceRandom100(player, true);
+    case ACT_SOURCE_RADIO:
+        return ChangeSourceRadio(player);
+    case ACT_SOURCE_IPOD:
+        return ChangeSourceIPod(player);
+    case ACT_SOURCE_PLAYLIST:
+        return ChangeSourceFirstPlaylist(player);
+    case ACT_SOURCE_CUSTOM:
+        return ChangeSourceCustom(static_cast<int>(strtol(parameter, nullptr, 10)), player);
+    case ACT_SOURCE_NEXT:
+        return ChangeSourceNext(player);
+    case ACT_SOURCE_PREVIOUS:
+        return ChangeSourcePrevious(player);
+    default:
+        return -1;
+    }
+}
+
+UpnpPlayer *FindPlayerByIndex(std::vector<UpnpPlayer *> &players, int index)
+{
+    for (UpnpPlayer *p : players) {
+        if (p->GetRendererIndex() == index)
+            return p;
+    }
+    return nullptr;
+}
+
+void SelectPlayer(const char *parameter, UpnpController *controller,
+                  std::vector<UpnpPlayer *> &upnpPlayers)
+{
+    int index = static_cast<int>(strtol(parameter, nullptr, 10));
+    if (index == -1) {
+        g_selectedRenderer = -1;
+        g_localSelected = 1;
+        return;
+    }
+    if (index < -1) {
+        TarnLog("%s:%d Bad player index [%d]", kLogUnit, 378, index);
+        return;
+    }
+    controller->Lock();
+    int rc = controller->SelectRenderer(static_cast<unsigned>(index));
+    controller->Unlock();
+    if (rc != 0)
+        return;  // out of range; the controller logs
+    if (!FindPlayerByIndex(upnpPlayers, index))
+        upnpPlayers.push_back(new UpnpPlayer(controller, index));
+    g_selectedRenderer = index;
+    g_localSelected = 0;
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------
+// Control requests.
+
+void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE])
+{
+#pragma GCC diagnostic push
+#pragma GCC diagnostic ignored "-Wdeprecated-declarations"
+    Json::StyledWriter writer;
+#pragma GCC diagnostic pop
+    std::string text = writer.write(reply);
+    memset(buffer, 0, CTRL_REPLY_SIZE);
+    snprintf(buffer, CTRL_REPLY_SIZE, "%s", text.c_str());
+}
+
+void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
+                     UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers)
+{
+    const char *parameter = request->parameter;
+    switch (request->action) {
+    case ACT_SOURCE_RANDOM:
+    case ACT_SOURCE_RADIO:
+    case ACT_SOURCE_IPOD:
+    case ACT_SOURCE_PLAYLIST:
+    case ACT_SOURCE_CUSTOM:
+    case ACT_SOURCE_NEXT:
+    case ACT_SOURCE_PREVIOUS:
+        // A source change always returns playback to the local player,
+        // before the change is even attempted.
+        g_localSelected = 1;
+        g_selectedRenderer = -1;
+        if (ChangeSource(request->action, parameter, localPlayer) == 0)
+            g_changed = 1;
+        return;
+    case ACT_SEARCH_SERVERS:
+        controller->SearchServers();
+        return;
+    case ACT_SEARCH_RENDERERS:
+        controller->SearchRenderers();
+        return;
+    case ACT_LIST_SERVERS:
+    case ACT_LIST_RENDERERS: {
+        int start = 0;
+        int limit = 0;
+        if (sscanf(parameter, "%d %d", &start, &limit) < 1)
+            start = 0;
+        controller->Lock();
+        if (request->action == ACT_LIST_SERVERS)
+            controller->GetServerList(reply, start, limit);
+        else
+            controller->GetRendererList(reply, start, limit);
+        controller->Unlock();
+        return;
+    }
+    case ACT_SELECT_PLAYER:
+        SelectPlayer(parameter, controller, upnpPlayers);
+        return;
+    case ACT_CLEAR_CHANGED:
+        g_changed = 0;
+        return;
+    case ACT_SET_CHANGED:
+        g_changed = 1;
+        return;
+    case ACT_SAVE_CUSTOM:
+        SaveCustomSource(static_cast<int>(strtol(parameter, nullptr, 10)), localPlayer);
+        return;
+    default:
+        break;
+    }
+    // Everything else goes to the selected player.
+    if (g_localSelected) {
+        localPlayer->HandleAction(request, reply);
+        return;
+    }
+    if (g_selectedRenderer == -1)
+        return;
+    UpnpPlayer *player = FindPlayerByIndex(upnpPlayers, g_selectedRenderer);
+    if (!player) {
+        TarnLog("%s:%d No upnp player index [%d]", kLogUnit, 395, g_selectedRenderer);
+        return;
+    }
+    player->HandleAction(request, reply);
+}
+
+int HandleRequest(int fd, LocalPlayer *localPlayer, UpnpController *controller,
+                  std::vector<UpnpPlayer *> &upnpPlayers)
+{
+    Json::Value reply;  // null unless a handler fills it
+    if (fd < 0)
+        return -1;
+    if (WaitFd(fd, false)) {
+        GuardedRequest in;
+        memset(&in, 0, sizeof(in));
+        ssize_t n;
+        do {
+            n = read(fd, &in.request, CTRL_REQUEST_SIZE);
+        } while (n == -1 && errno == EINTR);
+        if (n != CTRL_REQUEST_SIZE) {
+            TarnLog("%s:%d Failed to read action [%m]", kLogUnit, 311);
+        } else {
+            DispatchRequest(&in.request, reply, localPlayer, controller, upnpPlayers);
+            if (WaitFd(fd, true)) {
+                char out[CTRL_REPLY_SIZE];
+                FormatReply(reply, out);
+                ssize_t w = write(fd, out, sizeof(out));
+                (void)w;  // a client that went away is its own loss
+            }
+        }
+    }
+    close(fd);
+    return -1;
+}
+
+// ---------------------------------------------------------------------------
+// Process start-up, loop and shutdown.
+
+void DaemonOnSigterm(int)
+{
+    g_running = 0;
+}
+
+int DaemonSetupSignals()
+{
+    if (signal(SIGPIPE, SIG_IGN) == SIG_ERR) {
+        TarnLog("%s:%d Failed to signal()", kLogUnit, 44);
+        return -1;
+    }
+    if (signal(SIGTERM, DaemonOnSigterm) == SIG_ERR) {
+        TarnLog("%s:%d Failed to signal()", kLogUnit, 49);
+        return -1;
+    }
+    // SIGTERM was held back while the process was being set up (see
+    // DaemonInit); one that arrived meanwhile is delivered now.
+    sigset_t term;
+    sigemptyset(&term);
+    sigaddset(&term, SIGTERM);
+    sigprocmask(SIG_UNBLOCK, &term, nullptr);
+    return 0;
+}
+
+int DaemonInit()
+{
+    // Hold SIGTERM until its handler is installed, so that a stop request
+    // during start-up always ends in an orderly shutdown.
+    sigset_t term;
+    sigemptyset(&term);
+    sigaddset(&term, SIGTERM);
+    sigprocmask(SIG_BLOCK, &term, nullptr);
+
+    std::string pidFile = TarnPath(TARN_PID_FILE);
+    int pid = TLIBCReadPidFile(pidFile.c_str());
+    if (pid > 0 && pid != getpid() && TLIBCProcAlive(pid)) {
+        printf("Audio daemon already exists. Pid[%d]\n", pid);
+        fflush(stdout);
+        TarnLog("%s:%d Audio daemon already exists. Pid[%d]", kLogUnit, 67, pid);
+        exit(0);
+    }
+    if (daemon(0, 0) != 0) {
+        printf("Failed to daemon()\n");
+        fflush(stdout);
+        TarnLog("%s:%d Failed to daemon()", kLogUnit, 75);
+        return -1;
+    }
+    if (TLIBCProcPidFileCreate(pidFile.c_str()) != 0) {
+        TarnLog("%s:%d Failed to write pid.", kLogUnit, 81);
+        return -1;
+    }
+    if (DaemonSetupSignals() != 0) {
+        TarnLog("%s:%d Failed to setup signal handler.", kLogUnit, 86);
+        return -1;
+    }
+    return 0;
+}
+
+int DaemonStart(DaemonContext &ctx)
+{
+    std::string mplayerPath = TarnPath(TARN_MPLAYER_SOCKET);
+    ctx.mplayerListenFd = SocketListen(mplayerPath.c_str(), 1);
+    if (ctx.mplayerListenFd == -1) {
+        TarnLog("%s:%d Failed to init socket %s, %m", kLogUnit, 456, mplayerPath.c_str());
+        return -1;
+    }
+    fcntl(ctx.mplayerListenFd, F_SETFD, FD_CLOEXEC);
+    std::string ctrlPath = TarnPath(TARN_CTRL_SOCKET);
+    ctx.ctrlListenFd = SocketListen(ctrlPath.c_str(), 5);
+    if (ctx.ctrlListenFd == -1) {
+        TarnLog("%s:%d Failed to init socket %s, %m", kLogUnit, 462, ctrlPath.c_str());
+        return -1;
+    }
+    fcntl(ctx.ctrlListenFd, F_SETFD, FD_CLOEXEC);
+    ctx.controller = new UpnpController();
+    if (ctx.controller->Init() != 0) {
+        TarnLog("%s:%d Failed to init Upnp Controller", kLogUnit, 471);
+        return -1;
+    }
+    ctx.localPlayer = new LocalPlayer();
+    ctx.playerShm = static_cast<PlayerStatusShm *>(
+        ShmCreateAttach(TarnShmKeyPlayer(), TARN_SHM_PLAYER_SIZE, 1));
+    if (!ctx.playerShm) {
+        TarnLog("%s:%d Failed to create shared memory. (%m)", kLogUnit, 483);
+        return -1;
+    }
+    ctx.publishedShm = static_cast<PublishedStatusShm *>(
+        ShmCreateAttach(TarnShmKeyPublished(), TARN_SHM_PUBLISHED_SIZE, 1));
+    if (!ctx.publishedShm) {
+        TarnLog("%s:%d Failed to create shared memory. (%m)", kLogUnit, 490);
+        return -1;
+    }
+    ctx.controller->SearchServers();
+    ctx.controller->SearchRenderers();
+    return 0;
+}
+
+void DaemonLoopTurn(DaemonContext &ctx)
+{
+    usleep(100);
+
+    int fd = SocketAcceptPoll(ctx.mplayerListenFd);
+    if (fd >= 0)
+        ctx.localPlayer->AttachMplayerFd(fd);
+
+    fd = SocketAcceptPoll(ctx.ctrlListenFd);
+    if (fd >= 0)
+        HandleRequest(fd, ctx.localPlayer, ctx.controller, ctx.upnpPlayers);
+
+    // Local playback goes on while a renderer is selected.
+    ctx.localPlayer->Poll(ctx.playerShm);
+
+    // Renderer players: drop those whose renderer left, follow index moves,
+    // poll the rest.
+    UpnpController *controller = ctx.controller;
+    std::vector<UpnpPlayer *> &players = ctx.upnpPlayers;
+    controller->Lock();
+    for (size_t i = 0; i < players.size();) {
+        UpnpPlayer *player = players[i];
+        int index = controller->FindRendererByUdn(player->GetUdn());
+        if (index == -1) {
+            if (player->GetRendererIndex() == g_selectedRenderer)
+                g_selectedRenderer = -1;
+            delete player;
+            players.erase(players.begin() + static_cast<long>(i));
+            if (!g_localSelected)
+                g_changed = 1;
+            continue;
+        }
+        if (index != player->GetRendererIndex()) {
+            if (player->GetRendererIndex() == g_selectedRenderer)
+                g_selectedRenderer = index;
+            player->SetRendererIndex(index);
+            if (!g_localSelected)
+                g_changed = 1;
+        }
+        controller->SelectRenderer(static_cast<unsigned>(index));
+        player->Poll();
+        ++i;
+    }
+    if (!g_localSelected && g_selectedRenderer != -1)
+        controller->SelectRenderer(static_cast<unsigned>(g_selectedRenderer));
+    controller->Unlock();
+
+    ctx.publishedShm->changed = g_changed;
+
+    if (g_localSelected) {
+        ctx.localPlayer->PublishStatus(ctx.publishedShm);
+    } else if (g_selectedRenderer != -1) {
+        UpnpPlayer *selected = FindPlayerByIndex(players, g_selectedRenderer);
+        if (selected)
+            selected->PublishStatus(ctx.publishedShm);
+        else
+            memset(ctx.publishedShm, 0, TARN_SHM_PUBLISHED_SIZE);
+    }
+}
+
+int DaemonShutdown(DaemonContext &ctx)
+{
+    TarnLog("%s:%d tarnaudiod exit", kLogUnit, 530);
+    if (ctx.ctrlListenFd >= 0) {
+        close(ctx.ctrlListenFd);
+        unlink(TarnPath(TARN_CTRL_SOCKET).c_str());
+        ctx.ctrlListenFd = -1;
+    }
+    // The mplayer listening socket stays open and its file stays; the next
+    // start unlinks the path before binding.
+    if (ctx.localPlayer) {
+        ctx.localPlayer->SaveVolumeAndKill();
+        delete ctx.localPlayer;
+        ctx.localPlayer = nullptr;
+    }
+    for (UpnpPlayer *player : ctx.upnpPlayers)
+        delete player;
+    ctx.upnpPlayers.clear();
+    if (ctx.playerShm) {
+        // Bytes 0 to 4103 belong to mplayer-daemon and stay as they are.
+        memset(reinterpret_cast<char *>(ctx.playerShm) + 4104, 0, TARN_SHM_PLAYER_SIZE - 4104);
+        ShmDetach(ctx.playerShm);
+        ctx.playerShm = nullptr;
+    }
+    if (ctx.publishedShm) {
+        memset(ctx.publishedShm, 0, TARN_SHM_PUBLISHED_SIZE);
+        ShmDetach(ctx.publishedShm);
+        ctx.publishedShm = nullptr;
+    }
+    if (ctx.controller) {
+        ctx.controller->Uninit();
+        delete ctx.controller;
+        ctx.controller = nullptr;
+    }
+    unlink(TarnPath(TARN_PID_FILE).c_str());
+    return 0;
+}
+
+int DaemonRun()
+{
+    TarnLogOpen("tarnaudiod");
+    DaemonContext ctx;
+    if (DaemonInit() != 0) {
+        TarnLog("%s:%d Failed to init daemon.", kLogUnit, 450);
+        return DaemonShutdown(ctx);
+    }
+    if (DaemonStart(ctx) != 0 || !g_running)
+        return DaemonShutdown(ctx);
+    do {
+        DaemonLoopTurn(ctx);
+    } while (g_running);
+    return DaemonShutdown(ctx);
+}

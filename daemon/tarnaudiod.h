@@ -1,0 +1,65 @@
+// The tarnaudiod process: start-up, the polling loop, the control request
+// handler and the ordered shutdown.
+#ifndef TARN_TARNAUDIOD_H
+#define TARN_TARNAUDIOD_H
+
+#include <vector>
+
+#include <json/json.h>
+
+#include "daemon/tarn_types.h"
+
+class LocalPlayer;
+class UpnpController;
+class UpnpPlayer;
+
+// Everything main owns for the life of the process.
+struct DaemonContext {
+    int mplayerListenFd = -1;
+    int ctrlListenFd = -1;
+    UpnpController *controller = nullptr;
+    LocalPlayer *localPlayer = nullptr;
+    PlayerStatusShm *playerShm = nullptr;
+    PublishedStatusShm *publishedShm = nullptr;
+    std::vector<UpnpPlayer *> upnpPlayers;  // in order of creation
+};
+
+// SIGTERM: clears the running flag, nothing else.
+void DaemonOnSigterm(int sig);
+
+// SIGPIPE ignored, SIGTERM handled; 0 or -1.
+int DaemonSetupSignals();
+
+// Single-instance check (exits 0 when another daemon runs), daemon(), pid
+// file, signals. 0 or -1.
+int DaemonInit();
+
+// Sockets, controller, local player, segments, the two searches. 0 or -1
+// (what was created stays in ctx for DaemonShutdown).
+int DaemonStart(DaemonContext &ctx);
+
+// One turn of the main loop.
+void DaemonLoopTurn(DaemonContext &ctx);
+
+// Releases everything in order, removes the pid file. Returns 0.
+int DaemonShutdown(DaemonContext &ctx);
+
+// The whole process: init, start, loop, shutdown. Returns 0.
+int DaemonRun();
+
+// Serves one control connection: reads one request (waiting at most 0.5 s),
+// dispatches it, writes the 8192-byte reply (waiting at most 0.5 s) and
+// closes fd. Always returns -1 (callers ignore it).
+int HandleRequest(int fd, LocalPlayer *localPlayer, UpnpController *controller,
+                  std::vector<UpnpPlayer *> &upnpPlayers);
+
+// Dispatches a request that has been read: the daemon's own actions, the
+// source changes and the selected player. The reply value is filled in.
+void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
+                     UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers);
+
+// The reply text as sent: the styled JSON text cut to 8191 characters and
+// NUL-terminated in an 8192-byte buffer.
+void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE]);
+
+#endif
