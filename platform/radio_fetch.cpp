@@ -19,7 +19,8 @@ static const char kLogUnit[] = "radio_fetch";
 namespace {
 
 const long kConnectTimeoutSeconds = 5;
-const long kTotalTimeoutSeconds = 20;
+const long kDefaultTotalTimeoutSeconds = 20;
+const long kMaxTotalTimeoutSeconds = 120;
 const size_t kMaxBodyBytes = 4 * 1024 * 1024;
 const int kDefaultLimit = 100;
 const int kMaxLimit = 1000;
@@ -66,6 +67,19 @@ int DirectoryLimit()
     return n > kMaxLimit ? kMaxLimit : static_cast<int>(n);
 }
 
+// Longest time a fetch may take (it blocks the daemon's loop meanwhile).
+long DirectoryTimeout()
+{
+    char value[32];
+    std::string conf = TarnPath(TARN_INFO_CONF);
+    if (TLIBCFileGetKeyValue(conf.c_str(), "radio_directory_timeout", value, sizeof(value), 0) <= 0)
+        return kDefaultTotalTimeoutSeconds;
+    long n = strtol(value, nullptr, 10);
+    if (n < 1)
+        return kDefaultTotalTimeoutSeconds;
+    return n > kMaxTotalTimeoutSeconds ? kMaxTotalTimeoutSeconds : n;
+}
+
 // Fetches url and stores the stations as the list file at path.
 int UpdateListFile(const std::string &url, const std::string &path)
 {
@@ -103,6 +117,11 @@ std::string Trimmed(const std::string &text)
 
 int RadioDirectoryFetch(const std::string &url, std::string &body)
 {
+    return RadioDirectoryFetch(url, body, DirectoryTimeout());
+}
+
+int RadioDirectoryFetch(const std::string &url, std::string &body, long timeoutSeconds)
+{
     body.clear();
     CURL *curl = curl_easy_init();
     if (!curl) {
@@ -113,8 +132,11 @@ int RadioDirectoryFetch(const std::string &url, std::string &body)
     char error[CURL_ERROR_SIZE] = "";
     curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
     curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
-    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, kConnectTimeoutSeconds);
-    curl_easy_setopt(curl, CURLOPT_TIMEOUT, kTotalTimeoutSeconds);
+    if (timeoutSeconds < 1)
+        timeoutSeconds = 1;
+    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT,
+                     timeoutSeconds < kConnectTimeoutSeconds ? timeoutSeconds : kConnectTimeoutSeconds);
+    curl_easy_setopt(curl, CURLOPT_TIMEOUT, timeoutSeconds);
     curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L);
     curl_easy_setopt(curl, CURLOPT_MAXREDIRS, 3L);
     curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http,https");

@@ -7,6 +7,8 @@
 //                            array of {"name", "url"/"url_resolved",
 //                            "bitrate", "tags", ...})
 //   radio_directory_limit    stations asked for per list (default 100)
+//   radio_directory_timeout  seconds a fetch may take in all (default 20;
+//                            the daemon waits meanwhile)
 // Without a URL, or when the fetch fails, no file is written (a stale file
 // is left as it was, a missing one stays missing).
 #ifndef TARN_RADIO_FETCH_H
@@ -30,8 +32,10 @@ int RadioUpdateShoutcastByGenre(const std::string &name);
 }  // namespace MediaServer
 
 // Helpers of the updaters, exposed for their tests.
-// Fetches url into body: bounded connect and total time and size. 0 / -1.
+// Fetches url into body: connect time at most 5 s, total time at most the
+// configured time-out (or timeoutSeconds), body at most 4 MiB. 0 / -1.
 int RadioDirectoryFetch(const std::string &url, std::string &body);
+int RadioDirectoryFetch(const std::string &url, std::string &body, long timeoutSeconds);
 // Turns a directory answer (JSON array of station objects) into a list in
 // the radio list file layout ("bitrate" as kilobits per second text).
 // 0 / -1 when the text is not such an array.

@@ -145,12 +145,13 @@ int QueueRadioStation(const char *title, const char *url, LocalPlayer *player)
     return 0;
 }
 
+// 1 when the list's "total" is a non-zero number.
 int TotalOf(const Json::Value &list)
 {
     if (!list.isObject())
         return 0;
     const Json::Value &total = list["total"];
-    return total.isNumeric() ? total.asInt() : 0;
+    return total.isNumeric() && total.asDouble() != 0 ? 1 : 0;
 }
 
 // Favourite list, else user-defined list, else the RadioIO list: the first
