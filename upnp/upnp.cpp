@@ -213,7 +213,8 @@ int UpnpController::FindServerByUdn(const std::string &udn)
 }
 
 // ---------------------------------------------------------------------------
-// List replies.
+// List replies. The caller holds the lock (the request handler takes it
+// around these calls).
 
 int UpnpController::GetServerList(Json::Value &reply, int start, int limit)
 {
@@ -222,7 +223,6 @@ int UpnpController::GetServerList(Json::Value &reply, int start, int limit)
     if (limit < 0)
         limit = 10;
     Json::Value list(Json::arrayValue);
-    ScopedLock lock(this);
     for (size_t i = 0; i < servers.size(); ++i) {
         int index = static_cast<int>(i);
         if (index < start)
@@ -255,7 +255,6 @@ int UpnpController::GetRendererList(Json::Value &reply, int start, int limit)
     if (limit < 0)
         limit = 10;
     Json::Value list(Json::arrayValue);
-    ScopedLock lock(this);
     for (size_t i = 0; i < renderers.size(); ++i) {
         int index = static_cast<int>(i);
         if (index < start)

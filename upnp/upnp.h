@@ -54,6 +54,9 @@ public:
     int SearchServers();
     int SearchRenderers();
     int Search(const char *target);
+    // ClearList and Refresh take the lock themselves. Every other operation
+    // below (lists, selection, lookups, actions) expects the caller to hold
+    // it: the mutex is not recursive.
     int ClearList(const char *kind);
     int Refresh(const char *kind);
     int GetServerList(Json::Value &reply, int start, int limit);
