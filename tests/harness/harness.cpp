@@ -214,6 +214,9 @@ int CountFds(pid_t pid)
 Harness::Harness(bool freshSegments)
 {
     prctl(PR_SET_CHILD_SUBREAPER, 1, 0, 0, 0);
+    // A daemon that closes a connection early must fail a write, not end
+    // the test program.
+    signal(SIGPIPE, SIG_IGN);
     if (g_processRoot.empty()) {
         char tmpl[] = "/tmp/tarnroot.XXXXXX";
         if (!mkdtemp(tmpl)) {
@@ -462,8 +465,11 @@ int Harness::Start(int timeoutMs)
     }
     for (;;) {
         int pid = PidFromFile();
-        if (pid > 0 && TLIBCProcAlive(pid) && Exists(TARN_CTRL_SOCKET)) {
+        // Ready once it answers: the socket exists before the loop runs.
+        if (pid > 0 && TLIBCProcAlive(pid) && Exists(TARN_CTRL_SOCKET) &&
+            Request(ACT_GET_STATUS, nullptr, nullptr, static_cast<int>(end - NowMs())) == 0) {
             daemonPid = pid;
+            error.clear();
             return 0;
         }
         Reap();

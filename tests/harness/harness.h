@@ -27,7 +27,8 @@
 //
 // Processes. The test process becomes a child subreaper, so the daemonized
 // tarnaudiod and everything it starts are re-parented to it; the harness
-// reaps them and keeps their exit statuses. Nothing is started unless the
+// reaps them and keeps their exit statuses. SIGPIPE is ignored in the test
+// process (writes to a connection the daemon closed fail with EPIPE). Nothing is started unless the
 // process runs in a private network namespace (scripts/netns-run; ctest runs
 // every test that way): the daemon sends SSDP searches at start.
 #ifndef TARN_TEST_HARNESS_H
@@ -90,7 +91,8 @@ public:
 
     // ---- tarnaudiod -----------------------------------------------------
     // Starts tarnaudiod and waits until its pid file names a living process
-    // and its control socket exists. 0 on success; -1 with Error() set.
+    // and it answers a status request (ACT_GET_STATUS) on its control
+    // socket: the loop runs. 0 on success; -1 with Error() set.
     int Start(int timeoutMs = 15000);
     // Starts tarnaudiod and waits only for the launching (foreground)
     // process to end. Returns its exit status (-1 when it could not run);
