@@ -33,6 +33,7 @@ struct Request {
     std::string path;
     std::string head;  // request line and headers
     std::string body;
+    std::string issuedSid;  // SUBSCRIBE: the subscription ID this server answered with
 
     // Value of a header (name compared without regard to case), "" if absent.
     std::string Header(const char *name) const
@@ -271,6 +272,10 @@ private:
             int sidNumber;
             {
                 std::lock_guard<std::mutex> lock(mutex);
+                sidNumber = ++sidCounter;
+                if (req.method == "SUBSCRIBE" && subscribeStatus == 0)
+                    req.issuedSid = "uuid:fake-sid-" + std::to_string(boundPort) + "-" +
+                                    std::to_string(sidNumber);
                 requests.push_back(req);
                 auto it = routes.find(req.path);
                 if (it != routes.end()) {
@@ -279,16 +284,13 @@ private:
                 }
                 handler = soap;
                 subStatus = subscribeStatus;
-                sidNumber = ++sidCounter;
             }
             if (req.method == "SUBSCRIBE") {
                 if (subStatus != 0) {
                     SendAll(fd, Head(subStatus, "text/plain", 0));
                 } else {
-                    std::string sid = "uuid:fake-sid-" + std::to_string(boundPort) + "-" +
-                                      std::to_string(sidNumber);
                     SendAll(fd, Head(200, "text/plain", 0,
-                                     "SID: " + sid + "\r\nTIMEOUT: Second-1800\r\n"));
+                                     "SID: " + req.issuedSid + "\r\nTIMEOUT: Second-1800\r\n"));
                 }
             } else if (req.method == "UNSUBSCRIBE") {
                 SendAll(fd, Head(200, "text/plain", 0));
