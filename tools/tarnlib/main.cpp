@@ -9,6 +9,7 @@
 //
 // The library file is TARN_ROOT/usr/tarn/var/medialib.db unless --db names
 // another one.
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -68,6 +69,11 @@ static void PrintInfo(const TARN_MEDIA_INFO &s)
 
 static int CmdScan(const char *dir)
 {
+    struct stat st;
+    if (stat(dir, &st) != 0 || !S_ISDIR(st.st_mode)) {
+        fprintf(stderr, "tarnlib: cannot scan %s: not a readable folder\n", dir);
+        return 1;
+    }
     MediaLib lib;
     if (OpenLib(lib, true) != 0)
         return 1;
