@@ -27,8 +27,6 @@ const int kBlockLen = 16;
 const unsigned char kPad[kBlockLen - 4] = {'t', 'a', 'r', 'n', 's', 'o', 'n', 'g', 0x5a, 0xa5, 0x0f, 0xf0};
 
 std::mutex g_keyMutex;
-bool g_keyLoaded = false;
-unsigned char g_key[kKeyLen];
 
 std::string KeyFile()
 {
@@ -90,26 +88,23 @@ int CreateKey(const std::string &path)
     return ok ? 0 : -1;
 }
 
-// Loads the secret once per process, creating it on first use.
+// Reads the secret, creating it on first use. It is read each time (16
+// bytes) so that every process follows the file, whoever created it.
 int GetKey(unsigned char *key)
 {
     std::lock_guard<std::mutex> lock(g_keyMutex);
-    if (!g_keyLoaded) {
-        std::string path = KeyFile();
-        int r = ReadKey(path, g_key);
-        if (r == -1 && errno == ENOENT) {
-            if (CreateKey(path) != 0)
-                return -1;
-            r = ReadKey(path, g_key);
-        }
-        if (r != 0) {
-            TLOG("Failed to read the song id secret %s (remove it to have a new one made)",
-                 path.c_str());
+    std::string path = KeyFile();
+    int r = ReadKey(path, key);
+    if (r == -1 && errno == ENOENT) {
+        if (CreateKey(path) != 0)
             return -1;
-        }
-        g_keyLoaded = true;
+        r = ReadKey(path, key);
     }
-    memcpy(key, g_key, kKeyLen);
+    if (r != 0) {
+        TLOG("Failed to read the song id secret %s (remove it to have a new one made)",
+             path.c_str());
+        return -1;
+    }
     return 0;
 }
 
