@@ -86,19 +86,26 @@ PlaybinPlayer::~PlaybinPlayer()
         gst_object_unref(playbin_);
 }
 
-GstElement *PlaybinPlayer::BuildEqualizer()
+GstElement *PlaybinPlayer::BuildOutput(GstElement *sink)
 {
-    GstElement *elems[3] = {MakeElement("audioconvert", nullptr),
+    // The equalizer sits right in front of the sink, behind playbin's own
+    // output queue (up to a second of audio), so that a new setting is heard
+    // as quickly as a volume change.
+    GstElement *elems[4] = {MakeElement("audioconvert", nullptr),
                             MakeElement("equalizer-10bands", "equalizer"),
-                            MakeElement("audioconvert", nullptr)};
+                            MakeElement("audioconvert", nullptr), sink};
     if (!elems[0] || !elems[1] || !elems[2]) {
-        for (GstElement *e : elems)
-            if (e)
-                gst_object_unref(e);
-        return nullptr;
+        for (int i = 0; i < 3; ++i)
+            if (elems[i])
+                gst_object_unref(elems[i]);
+        TLOG("Playing without the equalizer.");
+        return sink;
     }
     equalizer_ = elems[1];
-    return MakeChainBin("equalizer-bin", elems, 3);
+    GstElement *bin = MakeChainBin("audio-output", elems, 4);
+    if (!bin)
+        equalizer_ = nullptr;
+    return bin;
 }
 
 GstElement *PlaybinPlayer::BuildSink(const std::string &audioOut)
@@ -174,13 +181,10 @@ int PlaybinPlayer::Init(const std::string &audioOut, int volume,
     GstElement *sink = BuildSink(audioOut);
     if (!sink)
         return -1;
-    g_object_set(playbin_, "audio-sink", sink, nullptr);
-
-    GstElement *eq = BuildEqualizer();
-    if (eq)
-        g_object_set(playbin_, "audio-filter", eq, nullptr);
-    else
-        TLOG("Playing without the equalizer.");
+    GstElement *out = BuildOutput(sink);
+    if (!out)
+        return -1;
+    g_object_set(playbin_, "audio-sink", out, nullptr);
 
     GstBus *bus = gst_element_get_bus(playbin_);
     busWatch_ = gst_bus_add_watch(bus, &PlaybinPlayer::OnBusMessage, this);

@@ -1,6 +1,6 @@
 // The playing half of mplayer-daemon: one GStreamer playbin that plays one
 // URI at a time into an output built once at start-up and kept across
-// songs, with the ten-band equalizer as its audio filter. Progress goes to
+// songs, with the ten-band equalizer in front of the sink. Progress goes to
 // the player status segment. Everything runs on the GLib main loop's thread
 // except the WAV output's sample callback.
 #ifndef MPLAYER_PLAYBIN_PLAYER_H
@@ -47,7 +47,8 @@ private:
     static GstFlowReturn OnNewSample(GstAppSink *sink, gpointer self);
 
     GstElement *BuildSink(const std::string &audioOut);
-    GstElement *BuildEqualizer();
+    // The output with the equalizer in front of sink.
+    GstElement *BuildOutput(GstElement *sink);
     void HandleTags(GstTagList *tags);
     void HandleEos();
     void HandleError(GstMessage *msg);
