@@ -15,8 +15,8 @@
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"
 
-// The equalizer lookup logs under the unit of the control calls that first
-// carried it; its line numbers are fixed so that log readers can rely on them.
+// The equalizer lookup's messages keep the unit name and line numbers that
+// log readers match on.
 static const char kEqLogUnit[] = "ctrl";
 
 namespace {
