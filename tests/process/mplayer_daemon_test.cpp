@@ -231,6 +231,32 @@ TEST_F(MplayerDaemonTest, SigtermCompletesTheWavFile)
     EXPECT_NEAR(w.Frequency(0.2, 1.2), 440, 5);
 }
 
+TEST_F(MplayerDaemonTest, SigtermDuringStartUpLeavesNoPidFile)
+{
+    std::string song = Media("s.flac");
+    ASSERT_TRUE(MakeTone(song, 440, 5));
+    Listen();
+    ASSERT_TRUE(player_.Start(root_, key_, "wav:" + wav_, song));
+    ASSERT_TRUE(WaitFor([&] { return access(pidFile_.c_str(), F_OK) == 0; }, 5000));
+    player_.Signal(SIGTERM);
+    ExpectCleanExit();
+}
+
+// Without HOME the GStreamer registry is kept under the run root.
+TEST_F(MplayerDaemonTest, StartsWithoutHome)
+{
+    std::string song = Media("s.flac");
+    ASSERT_TRUE(MakeTone(song, 440, 1));
+    Listen();
+    player_.unsetVars = {"HOME", "GST_REGISTRY", "XDG_CACHE_HOME"};
+    ASSERT_TRUE(player_.Start(root_, key_, "wav:" + wav_, song));
+    ASSERT_TRUE(sock_.Accept(10000));
+    ExpectEndAndAck(10000);
+    EXPECT_EQ(access(root_.Path("/var/cache/mplayer-daemon/gst-registry.bin").c_str(), F_OK), 0);
+    ASSERT_TRUE(sock_.Raw("quit"));
+    ExpectCleanExit();
+}
+
 TEST_F(MplayerDaemonTest, ClosedConnectionEndsTheProcess)
 {
     std::string song = Media("s.flac");

@@ -273,6 +273,11 @@ public:
             if (v.compare(0, 5, "TARN_") == 0 || v.find("_proxy=") != std::string::npos ||
                 v.find("_PROXY=") != std::string::npos)
                 continue;
+            bool drop = false;
+            for (const std::string &u : unsetVars)
+                drop = drop || v.compare(0, u.size() + 1, u + "=") == 0;
+            if (drop)
+                continue;
             env.push_back(v);
         }
         env.push_back("TARN_ROOT=" + root.dir);
@@ -289,6 +294,8 @@ public:
         return posix_spawn(&pid_, bin.c_str(), nullptr, nullptr, a.data(), e.data()) == 0;
     }
     pid_t Pid() const { return pid_; }
+    // Variables of the test's environment that the player does not get.
+    std::vector<std::string> unsetVars;
     bool Alive()
     {
         if (pid_ <= 0)

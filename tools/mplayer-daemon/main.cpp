@@ -237,6 +237,15 @@ int main(int argc, char **argv)
     const std::string pidPath = TarnPath(TARN_MPLAYER_PID_FILE);
     WritePidFile(pidPath);
 
+    // A SIGTERM from here on ends the process through the main loop, also
+    // while GStreamer is still starting (the first start builds its
+    // registry), so that the pid file never stays behind.
+    App app;
+    app.loop = g_main_loop_new(nullptr, FALSE);
+    g_unix_signal_add(SIGTERM, &OnQuitSignal, &app);
+    g_unix_signal_add(SIGINT, &OnQuitSignal, &app);
+    g_unix_signal_add(SIGHUP, &OnQuitSignal, &app);
+
     SetUpRegistry();
     gst_init(nullptr, nullptr);
 
@@ -244,8 +253,6 @@ int main(int argc, char **argv)
     segment.Attach(TarnShmKeyPlayer());
     segment.SetPid(static_cast<int>(getpid()));
 
-    App app;
-    app.loop = g_main_loop_new(nullptr, FALSE);
     PlaybinPlayer player(&segment);
     app.player = &player;
     if (player.Init(TarnAudioOut(), args.volume, args.gains) != 0) {
@@ -253,10 +260,6 @@ int main(int argc, char **argv)
         RemovePidFile(pidPath);
         return 1;
     }
-
-    g_unix_signal_add(SIGTERM, &OnQuitSignal, &app);
-    g_unix_signal_add(SIGINT, &OnQuitSignal, &app);
-    g_unix_signal_add(SIGHUP, &OnQuitSignal, &app);
 
     app.socketPath = TarnPath(TARN_MPLAYER_SOCKET);
     if (TryConnect(&app) != 0)
