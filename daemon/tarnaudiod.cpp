@@ -115,13 +115,15 @@ void SelectPlayer(const char *parameter, UpnpController *controller,
         TarnLog("%s:%d Bad player index [%d]", kLogUnit, 378, index);
         return;
     }
+    // The renderer list changes on the UPnP library's threads: select and
+    // read the renderer's record under the controller's lock.
     controller->Lock();
     int rc = controller->SelectRenderer(static_cast<unsigned>(index));
+    if (rc == 0 && !FindPlayerByIndex(upnpPlayers, index))
+        upnpPlayers.push_back(new UpnpPlayer(controller, index));
     controller->Unlock();
     if (rc != 0)
         return;  // out of range; the controller logs
-    if (!FindPlayerByIndex(upnpPlayers, index))
-        upnpPlayers.push_back(new UpnpPlayer(controller, index));
     g_selectedRenderer = index;
     g_localSelected = 0;
 }
