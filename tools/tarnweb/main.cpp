@@ -1,7 +1,8 @@
 // tarnweb: serves the songs that the daemon hands to UPnP renderers.
 //
 //   tarnweb [--port N] [--bind ADDR] [--threads N] [--db FILE]
-//           [--usb-root DIR] [--write-timeout SEC] [--verbose]
+//           [--usb-root DIR] [--write-timeout SEC] [--access-log FILE]
+//           [--verbose]
 //
 // The port defaults to "admin_port" of /etc/tarninfo.conf, the port the
 // daemon writes into its song URLs. "--port 0" takes any free port. Once
@@ -37,6 +38,7 @@ void Usage(FILE *out)
             "  --usb-root DIR    only files below DIR are served by path\n"
             "                    (default: usb_mount_root of the configuration, or /media/usb)\n"
             "  --write-timeout S drop a client that takes nothing for S seconds (default 60)\n"
+            "  --access-log FILE append one line per song request to FILE\n"
             "  --verbose         one line per request on standard error\n",
             TarnPath(TARN_INFO_CONF).c_str(), "/usr/tarn/var/medialib.db");
 }
@@ -82,6 +84,8 @@ int main(int argc, char **argv)
             ok = ParseInt(value, 1, 3600, &options.writeTimeoutSec);
         } else if (a == "--db") {
             options.dbPath = value;
+        } else if (a == "--access-log") {
+            options.accessLog = value;
         } else if (a == "--usb-root") {
             options.usbRoot = value;
         } else {

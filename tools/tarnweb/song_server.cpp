@@ -192,7 +192,13 @@ SongServer::SongServer(const SongServerOptions &opts) : options(opts), server(ne
     server->set_keep_alive_timeout(5);
     server->set_payload_max_length(64 * 1024);
 
+    if (!options.accessLog.empty()) {
+        accessFd = open(options.accessLog.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+        if (accessFd < 0)
+            TLOG("Cannot open the access log %s, %m", options.accessLog.c_str());
+    }
     auto serve = [this](const httplib::Request &req, httplib::Response &res, bool usb) {
+        LogAccess(req);
         std::string file = req.matches[1];
         std::string name, ext, path;
         if (!SplitName(file, &name, &ext)) {
@@ -250,7 +256,24 @@ SongServer::SongServer(const SongServerOptions &opts) : options(opts), server(ne
     }
 }
 
-SongServer::~SongServer() = default;
+SongServer::~SongServer()
+{
+    if (accessFd >= 0)
+        close(accessFd);
+}
+
+// "<address> <method> <path> <range>" as the request starts, one write per
+// line so that lines of parallel requests never mix.
+void SongServer::LogAccess(const httplib::Request &req)
+{
+    if (accessFd < 0)
+        return;
+    std::string line = req.remote_addr + " " + req.method + " " + req.path + " " +
+                       (req.has_header("Range") ? req.get_header_value("Range") : "-") + "\n";
+    if (write(accessFd, line.data(), line.size()) < 0) {
+        // A full disk must not stop the songs.
+    }
+}
 
 int SongServer::LookupSong(uint32_t id, std::string *path)
 {

@@ -33,6 +33,7 @@ struct SongServerOptions {
     std::string dbPath;        // media library database
     std::string usbRoot;       // "" -> TARNAudioUSBMountRoot()
     bool verbose = false;      // one line per request on stderr
+    std::string accessLog;     // file that gets one line per song request ("" none)
 };
 
 class SongServer {
@@ -53,7 +54,10 @@ private:
     void ServeFile(const httplib::Request &req, httplib::Response &res, const std::string &path,
                    const std::string &urlExt, bool usb);
 
+    void LogAccess(const httplib::Request &req);
+
     SongServerOptions options;
+    int accessFd = -1;
     std::unique_ptr<httplib::Server> server;
     std::mutex libraryMutex;
     std::unique_ptr<MediaLib> library;
