@@ -236,10 +236,17 @@ TEST_F(MplayerDaemonTest, SigtermDuringStartUpLeavesNoPidFile)
     std::string song = Media("s.flac");
     ASSERT_TRUE(MakeTone(song, 440, 5));
     Listen();
-    ASSERT_TRUE(player_.Start(root_, key_, "wav:" + wav_, song));
-    ASSERT_TRUE(WaitFor([&] { return access(pidFile_.c_str(), F_OK) == 0; }, 5000));
-    player_.Signal(SIGTERM);
-    ExpectCleanExit();
+    // As soon as the pid file names it, the daemon may stop it.
+    for (int i = 0; i < 5; ++i) {
+        SCOPED_TRACE(i);
+        PlayerProcess p;
+        ASSERT_TRUE(p.Start(root_, key_, "wav:" + wav_, song));
+        ASSERT_TRUE(WaitFor([&] { return access(pidFile_.c_str(), F_OK) == 0; }, 5000));
+        p.Signal(SIGTERM);
+        EXPECT_EQ(p.WaitExit(8000), 0);
+        EXPECT_NE(access(pidFile_.c_str(), F_OK), 0) << "pid file left behind";
+        unlink(pidFile_.c_str());
+    }
 }
 
 // Without HOME the GStreamer registry is kept under the run root.

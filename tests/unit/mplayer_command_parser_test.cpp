@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <random>
 #include <string>
 #include <vector>
 
@@ -205,6 +206,75 @@ TEST(MplayerCommandParser, GarbageIsSkippedAndSyncRecovered)
     EXPECT_EQ(out[4].type, MPCMD_QUIT);
     EXPECT_GT(p.GarbageBytes(), 100u);
     EXPECT_EQ(p.Pending(), 0u);
+}
+
+// Random sessions with random junk between (and right after) commands, fed
+// in random pieces: every command comes out, in order. The junk holds no
+// quote, backslash or letter a command word starts with.
+TEST(MplayerCommandParser, RandomJunkBetweenCommandsNeverLosesACommand)
+{
+    std::mt19937 rng(20261122);
+    const std::string junkChars("abcdefghijknortuvwxyz0123456789 .,;:!?#%&()[]{}<>=\0\n\x01\x7f\x80\xfe", 57);
+    auto junk = [&] {
+        std::string j;
+        int n = static_cast<int>(rng() % 12);
+        for (int i = 0; i < n; ++i)
+            j += junkChars[rng() % junkChars.size()];
+        return j;
+    };
+    const std::vector<std::string> uris = {"/mnt/HD/a.mp3", "/m/x \"y\" z.flac", "http://h:8000/s",
+                                           "/m/back\\slash.ogg", "/m/pause quit.wav"};
+    for (int round = 0; round < 300; ++round) {
+        std::string stream, want;
+        int count = 1 + static_cast<int>(rng() % 8);
+        for (int k = 0; k < count; ++k) {
+            stream += junk();
+            switch (rng() % 6) {
+            case 0:
+                stream += "pause";
+                want += "1:0;";
+                break;
+            case 1: {
+                const std::string &u = uris[rng() % uris.size()];
+                stream += Load(u);
+                want += "3:" + u + ";";
+                break;
+            }
+            case 2: {
+                int v = static_cast<int>(rng() % 200) - 100;
+                stream += Padded("seek " + std::to_string(v));
+                want += "4:" + std::to_string(v) + ";";
+                break;
+            }
+            case 3: {
+                int v = static_cast<int>(rng() % 101);
+                stream += Padded("setvol " + std::to_string(v));
+                want += "5:" + std::to_string(v) + ";";
+                break;
+            }
+            case 4:
+                stream += Padded("mute");
+                want += "6:0;";
+                break;
+            default:
+                stream += "quit";
+                want += "2:0;";
+                break;
+            }
+        }
+        stream += junk();
+        MplayerCommandParser p;
+        std::vector<MplayerCommand> out;
+        size_t at = 0;
+        while (at < stream.size()) {
+            size_t n = std::min(stream.size() - at, static_cast<size_t>(1 + rng() % 3000));
+            p.Feed(stream.data() + at, n, &out);
+            at += n;
+        }
+        p.Flush(&out);
+        ASSERT_EQ(Describe(out), want) << "round " << round;
+        EXPECT_LT(p.Pending(), 16u);
+    }
 }
 
 TEST(MplayerCommandParser, MalformedPaddedCommandsAreDropped)

@@ -121,6 +121,16 @@ int MplayerCommandParser::WordAt(size_t at, int *type, size_t *wordLen) const
     return partial ? 0 : -1;
 }
 
+bool MplayerCommandParser::LoadfileAt(size_t at) const
+{
+    if (buf_.compare(at, 8, "loadfile") != 0)
+        return false;
+    size_t i = at + 8;
+    while (i < buf_.size() && (buf_[i] == ' ' || buf_[i] == '\t'))
+        ++i;
+    return i > at + 8 && i < buf_.size() && buf_[i] == '"';
+}
+
 MplayerCommandParser::Result MplayerCommandParser::ParseArgs(size_t at, const char *allowed,
                                                              size_t *end)
 {
@@ -244,6 +254,11 @@ MplayerCommandParser::Result MplayerCommandParser::ParseLoadfile(size_t at, bool
             uri += '\\';
             i += (buf_[i + 1] == '\\') ? 2 : 1;
             continue;
+        }
+        if (c == 'l' && sawQuote && LoadfileAt(i)) {
+            // The next loadfile: whatever came after the last quote was
+            // garbage.
+            break;
         }
         if (IsLineEnd(c)) {
             if (!sawQuote) {

@@ -13,7 +13,9 @@
 // is not one is skipped as garbage, NUL bytes and white space separate
 // commands. A loadfile URI ends at a double quote that is followed by a NUL,
 // a line end, the next command word or the end of what the sender wrote in
-// one go (Flush); a quote followed by anything else belongs to the URI.
+// one go (Flush); a quote followed by anything else belongs to the URI,
+// unless no such end comes before a NUL, a line end or the next
+// 'loadfile "': then the URI ends at the last quote seen.
 #ifndef MPLAYER_COMMAND_PARSER_H
 #define MPLAYER_COMMAND_PARSER_H
 
@@ -71,6 +73,8 @@ private:
     // 1 a whole command word starts at 'at', 0 the rest of the buffer is a
     // proper prefix of one, -1 neither.
     int WordAt(size_t at, int *type, size_t *wordLen) const;
+    // "loadfile" with blanks and an opening quote starts at 'at'.
+    bool LoadfileAt(size_t at) const;
     void Compact();
 
     std::string buf_;

@@ -182,7 +182,9 @@ gboolean OnCommandData(gint fd, GIOCondition cond, gpointer p)
 
 int TryConnect(App *app)
 {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    // Non-blocking from the start: a daemon whose listen queue is full must
+    // not hold up this process (the connect is retried later).
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
     if (fd < 0)
         return -1;
     struct sockaddr_un addr;
@@ -193,7 +195,6 @@ int TryConnect(App *app)
         close(fd);
         return -1;
     }
-    fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
     app->fd = fd;
     app->watch = g_unix_fd_add(fd, static_cast<GIOCondition>(G_IO_IN | G_IO_HUP | G_IO_ERR),
                                &OnCommandData, app);
@@ -233,18 +234,19 @@ int main(int argc, char **argv)
     if (MplayerParseArgs(argc, argv, &args) != 0)
         TLOG("An option lacks its value; it is ignored.");
 
-    // First of all, so that the daemon sees this process as alive at once.
-    const std::string pidPath = TarnPath(TARN_MPLAYER_PID_FILE);
-    WritePidFile(pidPath);
-
-    // A SIGTERM from here on ends the process through the main loop, also
-    // while GStreamer is still starting (the first start builds its
-    // registry), so that the pid file never stays behind.
+    // From before the pid file names this process, a SIGTERM ends it
+    // through the main loop, also while GStreamer is still starting (the
+    // first start builds its registry), so that the pid file never stays
+    // behind.
     App app;
     app.loop = g_main_loop_new(nullptr, FALSE);
     g_unix_signal_add(SIGTERM, &OnQuitSignal, &app);
     g_unix_signal_add(SIGINT, &OnQuitSignal, &app);
     g_unix_signal_add(SIGHUP, &OnQuitSignal, &app);
+
+    // Early, so that the daemon sees this process as alive at once.
+    const std::string pidPath = TarnPath(TARN_MPLAYER_PID_FILE);
+    WritePidFile(pidPath);
 
     SetUpRegistry();
     gst_init(nullptr, nullptr);
