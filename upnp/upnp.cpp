@@ -14,6 +14,8 @@
 #include <cstring>
 #include <strings.h>
 
+#include <curl/curl.h>
+
 
 #include "platform/tarn_log.h"
 #include "upnp/get_capability.h"
@@ -65,7 +67,9 @@ UpnpController::~UpnpController()
 int UpnpController::Init()
 {
     // libupnp's worker pool keeps its built-in bounds: this libupnp offers no
-    // call to change them.
+    // call to change them. Description downloads use libcurl from libupnp's
+    // threads; its global state is set up here, before they exist.
+    curl_global_init(CURL_GLOBAL_DEFAULT);
     int rc = UpnpInit(nullptr, 0);
     if (rc != UPNP_E_SUCCESS) {
         TLOG("Failed to UpnpInit(), [%s]", UpnpGetErrorMessage(rc));

@@ -4,8 +4,9 @@
 
 #include <cstdio>
 #include <cstring>
-#include <ctime>
 #include <vector>
+
+#include <curl/curl.h>
 
 #include "upnp/upnp_sdk.h"
 
@@ -290,69 +291,76 @@ int XmlParseGuarded(const char *text, IXML_Document **doc)
     return ixmlParseBufferEx(text, doc);
 }
 
-static double MonotonicSeconds()
+namespace {
+
+// Collects a download's body up to the size limit.
+struct DownloadBody {
+    std::vector<char> data;
+    bool tooLarge = false;
+};
+
+size_t CollectBody(char *ptr, size_t size, size_t count, void *user)
 {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) / 1e9;
+    DownloadBody *body = static_cast<DownloadBody *>(user);
+    size_t n = size * count;
+    if (body->data.size() + n > static_cast<size_t>(kXmlMaxDocumentBytes)) {
+        body->tooLarge = true;
+        return 0;  // makes libcurl stop with CURLE_WRITE_ERROR
+    }
+    body->data.insert(body->data.end(), ptr, ptr + n);
+    return n;
 }
+
+}  // namespace
 
 int XmlDownloadDoc(const char *url, IXML_Document **doc)
 {
-    // Each read waits at most this long; the whole download at most
-    // kTotalSeconds, so a device that trickles its answer cannot hold a
-    // libupnp worker thread for long.
-    static const int kReadTimeout = 5;
-    static const double kTotalSeconds = 10.0;
+    // A device that answers slowly, never finishes or trickles its answer
+    // holds the calling libupnp thread for at most these times.
+    static const long kConnectSeconds = 5;
+    static const long kTotalSeconds = 10;
     if (doc == nullptr)
         return UPNP_E_INVALID_PARAM;
     *doc = nullptr;
-    if (url == nullptr || url[0] == '\0')
+    if (url == nullptr || strncmp(url, "http://", 7) != 0)
         return UPNP_E_INVALID_URL;
 
-    void *handle = nullptr;
-    char *contentType = nullptr;
-    int contentLength = 0;
-    int httpStatus = 0;
-    int rc = UpnpOpenHttpGet(url, &handle, &contentType, &contentLength, &httpStatus,
-                             kReadTimeout);
-    if (rc != UPNP_E_SUCCESS)
-        return rc;
-    if (httpStatus != 200) {
-        UpnpCloseHttpGet(handle);
+    CURL *curl = curl_easy_init();
+    if (curl == nullptr)
+        return UPNP_E_OUTOF_MEMORY;
+    DownloadBody body;
+    curl_easy_setopt(curl, CURLOPT_URL, url);
+    curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http");
+    curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 0L);
+    curl_easy_setopt(curl, CURLOPT_PROXY, "");
+    curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, kConnectSeconds);
+    curl_easy_setopt(curl, CURLOPT_TIMEOUT, kTotalSeconds);
+    curl_easy_setopt(curl, CURLOPT_MAXFILESIZE, static_cast<long>(kXmlMaxDocumentBytes));
+    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, CollectBody);
+    curl_easy_setopt(curl, CURLOPT_WRITEDATA, &body);
+    CURLcode res = curl_easy_perform(curl);
+    long status = 0;
+    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
+    curl_easy_cleanup(curl);
+
+    if (res != CURLE_OK) {
+        if (body.tooLarge || res == CURLE_FILESIZE_EXCEEDED)
+            return UPNP_E_OUTOF_BOUNDS;
+        if (res == CURLE_COULDNT_CONNECT)
+            return UPNP_E_SOCKET_CONNECT;
+        if (res == CURLE_OPERATION_TIMEDOUT)
+            return UPNP_E_TIMEDOUT;
+        if (res == CURLE_URL_MALFORMAT || res == CURLE_COULDNT_RESOLVE_HOST ||
+            res == CURLE_UNSUPPORTED_PROTOCOL)
+            return UPNP_E_INVALID_URL;
         return UPNP_E_BAD_RESPONSE;
     }
-    if (contentLength > kXmlMaxDocumentBytes) {
-        UpnpCloseHttpGet(handle);
-        return UPNP_E_OUTOF_BOUNDS;
-    }
-
-    std::vector<char> body;
-    const double deadline = MonotonicSeconds() + kTotalSeconds;
-    char chunk[4096];
-    for (;;) {
-        size_t size = sizeof(chunk);
-        rc = UpnpReadHttpGet(handle, chunk, &size, kReadTimeout);
-        if (rc != UPNP_E_SUCCESS)
-            break;
-        if (size == 0)
-            break;
-        if (body.size() + size > static_cast<size_t>(kXmlMaxDocumentBytes)) {
-            rc = UPNP_E_OUTOF_BOUNDS;
-            break;
-        }
-        body.insert(body.end(), chunk, chunk + size);
-        if (MonotonicSeconds() > deadline) {
-            rc = UPNP_E_TIMEDOUT;
-            break;
-        }
-    }
-    UpnpCloseHttpGet(handle);
-    if (rc != UPNP_E_SUCCESS)
-        return rc;
-    body.push_back('\0');
+    if (status != 200)
+        return UPNP_E_BAD_RESPONSE;
+    body.data.push_back('\0');
     IXML_Document *parsed = nullptr;
-    if (XmlParseGuarded(body.data(), &parsed) != IXML_SUCCESS || parsed == nullptr) {
+    if (XmlParseGuarded(body.data.data(), &parsed) != IXML_SUCCESS || parsed == nullptr) {
         if (parsed != nullptr)
             ixmlDocument_free(parsed);
         return UPNP_E_INVALID_DESC;

@@ -68,8 +68,10 @@ int XmlCheckLimits(const char *text, size_t length);
 // (IXML_SUCCESS) or IXML_INSUFFICIENT_MEMORY for a refused text.
 int XmlParseGuarded(const char *text, IXML_Document **doc);
 
-// Downloads and parses an XML document with libupnp's HTTP client, bounded
-// in size and time. Returns UPNP_E_SUCCESS with *doc set, or a libupnp error
+// Downloads (libcurl, plain HTTP only, no proxy, no redirects) and parses an
+// XML document, bounded in size and time. libupnp's own downloader has no
+// bounds and parses without the limits above; its HTTP GET calls send a
+// broken Host header in this libupnp version. Returns UPNP_E_SUCCESS with *doc set, or a libupnp error
 // code (UPNP_E_INVALID_DESC for a document that does not parse or is refused).
 int XmlDownloadDoc(const char *url, IXML_Document **doc);
 

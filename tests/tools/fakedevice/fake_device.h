@@ -18,7 +18,10 @@
 
 #include <atomic>
 #include <chrono>
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
+#include <strings.h>
 #include <functional>
 #include <map>
 #include <mutex>
@@ -404,6 +407,46 @@ inline int AnnounceService(const char *fromIp, bool alive, const std::string &ud
 {
     return SendSsdpNotify(fromIp, alive ? "ssdp:alive" : "ssdp:byebye", serviceType,
                           udn + "::" + serviceType, location);
+}
+
+// The IPv4 address on which some process of this network namespace listens
+// on a TCP port ("" when none): libupnp's HTTP server shows which address a
+// control point chose.
+inline std::string ListeningAddress(int port)
+{
+    FILE *f = fopen("/proc/net/tcp", "r");
+    if (f == nullptr)
+        return std::string();
+    char line[512];
+    std::string found;
+    while (fgets(line, sizeof(line), f) != nullptr) {
+        unsigned addr = 0, lport = 0, state = 0;
+        if (sscanf(line, " %*d: %8X:%4X %*8X:%*4X %2X", &addr, &lport, &state) != 3)
+            continue;
+        if (static_cast<int>(lport) == port && state == 0x0A) {
+            in_addr a;
+            a.s_addr = addr;  // /proc shows the address in host order of the raw bytes
+            char text[INET_ADDRSTRLEN];
+            inet_ntop(AF_INET, &a, text, sizeof(text));
+            found = text;
+            break;
+        }
+    }
+    fclose(f);
+    return found;
+}
+
+// The namespace's two veth ends (scripts/netns-run): the one a control point
+// at controlPointIp is not on, so that announcements cross the pair.
+inline void PeerInterface(const std::string &controlPointIp, std::string &ip, std::string &iface)
+{
+    if (controlPointIp == "10.77.0.1") {
+        ip = "10.77.0.2";
+        iface = "tveth1";
+    } else {
+        ip = "10.77.0.1";
+        iface = "tveth0";
+    }
 }
 
 // Splits "http://host:port/path" (as found in a GENA CALLBACK header, with or
