@@ -48,7 +48,7 @@ protected:
         ASSERT_EQ(0, h.Start()) << h.Error();
         // The devices go on the veth end the daemon's libupnp did not take
         // (its HTTP server listens on 49152), so that SSDP crosses the pair.
-        std::string daemonIp = fakedev::ListeningAddress(49152);
+        daemonIp = fakedev::ListeningAddress(49152);
         ASSERT_FALSE(daemonIp.empty());
         fakedev::PeerInterface(daemonIp, deviceIp, deviceIface);
         serverIp = "10.77.0.1";
@@ -114,7 +114,7 @@ protected:
     }
 
     tarntest::Harness h;
-    std::string deviceIp, deviceIface, serverIp;
+    std::string daemonIp, deviceIp, deviceIface, serverIp;
     pid_t renderer = -1;
     pid_t server = -1;
 };
@@ -183,11 +183,12 @@ TEST_F(UpnpDevices, RendererAndServerAreListedWithTheirKeys)
     EXPECT_TRUE(WaitUntil([&] { return Find(ACT_LIST_RENDERERS, kRendererUdn).isNull(); }, 15000));
     EXPECT_FALSE(Find(ACT_LIST_SERVERS, kServerUdn).isNull());
     // minidlna's own bye-bye does not reach the daemon in this namespace (see
-    // StartServer); the same bye-bye, sent for it, removes the server.
+    // StartServer); the same bye-bye, sent for it on the daemon's address
+    // (delivered through the local multicast loop), removes the server.
     kill(server, SIGTERM);
     bool gone = false;
     for (int attempt = 0; attempt < 5 && !gone; ++attempt) {
-        fakedev::AnnounceService(deviceIp.c_str(), false, kServerUdn,
+        fakedev::AnnounceService(daemonIp.c_str(), false, kServerUdn,
                                  "urn:schemas-upnp-org:service:ContentDirectory:1", "");
         gone = WaitUntil([&] { return Find(ACT_LIST_SERVERS, kServerUdn).isNull(); }, 3000);
     }

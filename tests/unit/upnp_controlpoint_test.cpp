@@ -18,7 +18,10 @@
 
 namespace {
 
-const char kDeviceIp[] = "10.77.0.2";
+// Fake devices serve and announce on the control point's own address: their
+// multicast announcements reach it through the local loop (a copy crossing
+// the veth pair carries a local source address and is dropped).
+std::string g_deviceIp = "10.77.0.2";
 const char kAvt[] = "urn:schemas-upnp-org:service:AVTransport:1";
 const char kRcs[] = "urn:schemas-upnp-org:service:RenderingControl:1";
 const char kCms[] = "urn:schemas-upnp-org:service:ConnectionManager:1";
@@ -73,7 +76,7 @@ struct FakeRenderer {
     int Start(const std::string &id, const std::string &name)
     {
         udn = id;
-        if (http.Start(kDeviceIp, 0) <= 0)
+        if (http.Start(g_deviceIp.c_str(), 0) <= 0)
             return -1;
         location = http.BaseUrl() + "/description.xml";
         fakedev::Route desc, avt, rcs, cms;
@@ -109,7 +112,7 @@ struct FakeRenderer {
     }
     int Announce(bool alive = true)
     {
-        return fakedev::AnnounceService(kDeviceIp, alive, udn, kAvt, location);
+        return fakedev::AnnounceService(g_deviceIp.c_str(), alive, udn, kAvt, location);
     }
 };
 
@@ -121,6 +124,9 @@ protected:
             return;
         controller = new UpnpController();
         initResult = controller->Init();
+        const char *own = initResult == 0 ? UpnpGetServerIpAddress() : nullptr;
+        if (own != nullptr && own[0] != '\0')
+            g_deviceIp = own;
     }
     static void TearDownTestSuite()
     {
@@ -212,7 +218,7 @@ TEST_F(UpnpControlPoint, AnnouncedRendererIsListedProbedAndSubscribed)
     ASSERT_TRUE(AnnounceUntilListed(device));
     RENDERER_INFO r = Renderer(device.udn);
     EXPECT_EQ("Living Room", r.friendly_name);
-    EXPECT_EQ(kDeviceIp, r.ip);
+    EXPECT_EQ(g_deviceIp, r.ip);
     EXPECT_EQ(std::to_string(device.http.Port()), r.port);
     EXPECT_EQ(device.http.BaseUrl() + "/AVTransport/control", r.avt_control_url);
     EXPECT_TRUE(r.can_seek);
@@ -363,7 +369,7 @@ TEST_F(UpnpControlPoint, RendererThatRefusesConnectionsLeavesOnItsNextAction)
 TEST_F(UpnpControlPoint, MediaServerByAnnouncementAndByeBye)
 {
     fakedev::FakeHttpServer http;
-    ASSERT_GT(http.Start(kDeviceIp, 0), 0);
+    ASSERT_GT(http.Start(g_deviceIp.c_str(), 0), 0);
     fakedev::Route desc;
     desc.body = Fixture("minidlna_description.xml");
     http.SetRoute("/rootDesc.xml", desc);
@@ -371,7 +377,7 @@ TEST_F(UpnpControlPoint, MediaServerByAnnouncementAndByeBye)
     std::string location = http.BaseUrl() + "/rootDesc.xml";
     bool listed = false;
     for (int i = 0; i < 5 && !listed; ++i) {
-        fakedev::AnnounceService(kDeviceIp, true, udn, kCds, location);
+        fakedev::AnnounceService(g_deviceIp.c_str(), true, udn, kCds, location);
         listed = WaitUntil([&] { return ServerIndex(udn) >= 0; }, 3000);
     }
     ASSERT_TRUE(listed);
@@ -381,17 +387,17 @@ TEST_F(UpnpControlPoint, MediaServerByAnnouncementAndByeBye)
     EXPECT_EQ("Test Server", s["friendly_name"].asString());
     EXPECT_EQ(http.BaseUrl() + "/ctl/ContentDir", s["control_url"].asString());
     // A bye-bye for another service type of the same device changes nothing.
-    fakedev::AnnounceService(kDeviceIp, false, udn, kCms, location);
+    fakedev::AnnounceService(g_deviceIp.c_str(), false, udn, kCms, location);
     std::this_thread::sleep_for(std::chrono::milliseconds(500));
     EXPECT_GE(ServerIndex(udn), 0);
-    fakedev::AnnounceService(kDeviceIp, false, udn, kCds, location);
+    fakedev::AnnounceService(g_deviceIp.c_str(), false, udn, kCds, location);
     EXPECT_TRUE(WaitUntil([&] { return ServerIndex(udn) < 0; }, 5000));
 }
 
 TEST_F(UpnpControlPoint, HostileDevicesNeitherCrashNorBlock)
 {
     fakedev::FakeHttpServer http;
-    ASSERT_GT(http.Start(kDeviceIp, 0), 0);
+    ASSERT_GT(http.Start(g_deviceIp.c_str(), 0), 0);
     std::string deep;
     for (int i = 0; i < 100000; ++i)
         deep += "<a>";
@@ -421,7 +427,7 @@ TEST_F(UpnpControlPoint, HostileDevicesNeitherCrashNorBlock)
         route.mode = k.mode;
         route.body = k.body;
         http.SetRoute(k.path, route);
-        fakedev::AnnounceService(kDeviceIp, true, Uuid(99), kAvt, http.BaseUrl() + k.path);
+        fakedev::AnnounceService(g_deviceIp.c_str(), true, Uuid(99), kAvt, http.BaseUrl() + k.path);
     }
     // A renderer whose service descriptions never finish.
     fakedev::Route slowDesc, stall;
@@ -431,11 +437,11 @@ TEST_F(UpnpControlPoint, HostileDevicesNeitherCrashNorBlock)
     stall.body = Fixture("gmediarender_renderingcontrol_scpd.xml");
     http.SetRoute("/slow.xml", slowDesc);
     http.SetRoute("/RenderingControl/scpd.xml", stall);
-    fakedev::AnnounceService(kDeviceIp, true, Uuid(94), kAvt, http.BaseUrl() + "/slow.xml");
+    fakedev::AnnounceService(g_deviceIp.c_str(), true, Uuid(94), kAvt, http.BaseUrl() + "/slow.xml");
     // Announcements with broken locations.
-    fakedev::AnnounceService(kDeviceIp, true, Uuid(95), kAvt, "http://");
-    fakedev::AnnounceService(kDeviceIp, true, Uuid(96), kAvt, "no url at all");
-    fakedev::AnnounceService(kDeviceIp, true, Uuid(97), kAvt, "http://10.77.0.2:1/refused.xml");
+    fakedev::AnnounceService(g_deviceIp.c_str(), true, Uuid(95), kAvt, "http://");
+    fakedev::AnnounceService(g_deviceIp.c_str(), true, Uuid(96), kAvt, "no url at all");
+    fakedev::AnnounceService(g_deviceIp.c_str(), true, Uuid(97), kAvt, "http://" + g_deviceIp + ":1/refused.xml");
 
     // Meanwhile the lock stays available: the main loop is never held up.
     auto until = std::chrono::steady_clock::now() + std::chrono::seconds(3);
