@@ -784,10 +784,15 @@ void PlayStart(Ours &o, Mpd &m, const Songs &s, int repeats)
         usleep(300000);
         double t0 = NowSec(), tPlay = NAN, tPos = NAN;
         o.Text(ACT_PLAY_INDEX, "0");
+        // The segment keeps the last song's position until the new player
+        // reports; count only a position that grew from the new start.
+        bool sawStart = false;
         while (NowSec() - t0 < 10 && std::isnan(tPos)) {
             if (std::isnan(tPlay) && seg->state == PLAYER_STATE_PLAYING)
                 tPlay = NowSec() - t0;
-            if (seg->state == PLAYER_STATE_PLAYING && seg->position > 0)
+            if (seg->state == PLAYER_STATE_PLAYING && seg->position == 0)
+                sawStart = true;
+            if (sawStart && seg->position > 0)
                 tPos = NowSec() - t0;
             usleep(1000);
         }
