@@ -238,15 +238,26 @@ TEST_F(MplayerRadioTest, StationNameAndChangingStreamTitle)
     EXPECT_NEAR(w.Frequency(0.5, 2.5), 440, 5);  // inside the first pass of the looped file
 }
 
-// A local song after the radio: the station and title are cleared, and a
-// stream that the server ends counts as an ended song.
+// A stream that the server ends counts as an ended song, and a local song
+// after the radio clears the station and title.
 TEST_F(MplayerRadioTest, StreamEndIsSongEndAndLocalSongClearsStation)
 {
+    // A title longer than its field (264 bytes) in two-byte characters: cut
+    // at a character boundary.
+    std::string e = "\xc3\xa9";
+    std::string longTitle;
+    for (int i = 0; i < 150; ++i)
+        longTitle += e;
+    std::string cut;
+    for (int i = 0; i < 131; ++i)
+        cut += e;
     IcyServer server;
-    ASSERT_TRUE(server.Start(mp3_, "Short Radio", {"Only Title"}, 100.0, 4.0));
+    ASSERT_TRUE(server.Start(mp3_, "Short Radio", {longTitle}, 100.0, 4.0));
     ASSERT_TRUE(player_.Start(root_, key_, "wav:" + wav_, server.Url()));
     ASSERT_TRUE(sock_.Accept(10000));
     EXPECT_TRUE(WaitFor([&] { return seg_.Station() == "Short Radio"; }, 10000));
+    EXPECT_TRUE(WaitFor([&] { return seg_.Title() == cut; }, 10000))
+        << seg_.Title().size() << " bytes: [" << seg_.Title() << "]";
     ASSERT_TRUE(WaitFor([&] { return seg_.State() == PLAYER_STATE_ENDED; }, 20000))
         << "state " << seg_.State();
     seg_.SetState(PLAYER_STATE_PLAYING);
