@@ -70,6 +70,7 @@ int UpnpController::Init()
     // call to change them. Description downloads use libcurl from libupnp's
     // threads; its global state is set up here, before they exist.
     curl_global_init(CURL_GLOBAL_DEFAULT);
+    XmlAbortDownloads(false);
     int rc = UpnpInit(nullptr, 0);
     if (rc != UPNP_E_SUCCESS) {
         TLOG("Failed to UpnpInit(), [%s]", UpnpGetErrorMessage(rc));
@@ -97,6 +98,9 @@ int UpnpController::Init()
 
 int UpnpController::Uninit()
 {
+    // Description downloads in progress on libupnp's threads give up, so
+    // that UpnpFinish does not wait for slow devices.
+    XmlAbortDownloads(true);
     UpnpUnRegisterClient(client_handle);
     UpnpFinish();
     client_handle = -1;

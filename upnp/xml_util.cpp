@@ -2,6 +2,7 @@
 // DIDL-Lite metadata that goes with SetAVTransportURI.
 #include "upnp/xml_util.h"
 
+#include <atomic>
 #include <cstdio>
 #include <cstring>
 #include <vector>
@@ -293,6 +294,14 @@ int XmlParseGuarded(const char *text, IXML_Document **doc)
 
 namespace {
 
+// Set while the control point shuts down: running downloads give up.
+std::atomic<bool> g_abortDownloads{false};
+
+int CheckAbort(void *, curl_off_t, curl_off_t, curl_off_t, curl_off_t)
+{
+    return g_abortDownloads.load() ? 1 : 0;
+}
+
 // Collects a download's body up to the size limit.
 struct DownloadBody {
     std::vector<char> data;
@@ -312,6 +321,11 @@ size_t CollectBody(char *ptr, size_t size, size_t count, void *user)
 }
 
 }  // namespace
+
+void XmlAbortDownloads(bool abort)
+{
+    g_abortDownloads = abort;
+}
 
 int XmlDownloadDoc(const char *url, IXML_Document **doc)
 {
@@ -339,6 +353,8 @@ int XmlDownloadDoc(const char *url, IXML_Document **doc)
     curl_easy_setopt(curl, CURLOPT_MAXFILESIZE, static_cast<long>(kXmlMaxDocumentBytes));
     curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, CollectBody);
     curl_easy_setopt(curl, CURLOPT_WRITEDATA, &body);
+    curl_easy_setopt(curl, CURLOPT_XFERINFOFUNCTION, CheckAbort);
+    curl_easy_setopt(curl, CURLOPT_NOPROGRESS, 0L);
     CURLcode res = curl_easy_perform(curl);
     long status = 0;
     curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
@@ -349,6 +365,8 @@ int XmlDownloadDoc(const char *url, IXML_Document **doc)
             return UPNP_E_OUTOF_BOUNDS;
         if (res == CURLE_COULDNT_CONNECT)
             return UPNP_E_SOCKET_CONNECT;
+        if (res == CURLE_ABORTED_BY_CALLBACK)
+            return UPNP_E_CANCELED;
         if (res == CURLE_OPERATION_TIMEDOUT)
             return UPNP_E_TIMEDOUT;
         if (res == CURLE_URL_MALFORMAT || res == CURLE_COULDNT_RESOLVE_HOST ||

@@ -253,7 +253,24 @@ TEST_F(UpnpHostile, DaemonSurvivesAndKeepsAnswering)
     EXPECT_EQ(0, unanswered.load()) << "of " << requests.load() << " requests";
     EXPECT_GT(h.PidFromFile(), 0);
     EXPECT_EQ(0, kill(h.Pid(), 0));
+
+    // Stopped while a probe waits on a stalled service description: the
+    // daemon still ends promptly.
+    fakedev::Route lastDesc;
+    lastDesc.body = fakedev::DeviceDescription(
+        Uuid(8), "stalling", "m", {{kAvt, "AVTransport8"}, {kRcs, "RenderingControl8"}});
+    bad.SetRoute("/last.xml", lastDesc);
+    bad.SetRoute("/RenderingControl8/scpd.xml", stall);
+    bool probing = false;
+    for (int i = 0; i < 5 && !probing; ++i) {
+        fakedev::AnnounceService(daemonIp.c_str(), true, Uuid(8), kAvt, bad.BaseUrl() + "/last.xml");
+        probing = bad.WaitFor("GET", "/RenderingControl8/scpd.xml", 1, 3000);
+    }
+    EXPECT_TRUE(probing);
+    auto t0 = std::chrono::steady_clock::now();
     EXPECT_EQ(0, h.Stop());
+    double stopSeconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - t0).count();
+    EXPECT_LT(stopSeconds, 5.0);
 }
 
 }  // namespace

@@ -6,6 +6,7 @@
 #include <fstream>
 #include <sstream>
 #include <string>
+#include <thread>
 
 #include "tests/tools/fakedevice/fake_device.h"
 #include "upnp/get_capability.h"
@@ -213,6 +214,35 @@ TEST_F(UpnpProbe, HostileAnswersFailInBoundedTime)
     ASSERT_EQ(UPNP_E_SUCCESS, XmlDownloadDoc((base + "/rcs.xml").c_str(), &doc));
     ASSERT_NE(nullptr, doc);
     ixmlDocument_free(doc);
+}
+
+TEST_F(UpnpProbe, ShutdownCancelsARunningDownload)
+{
+    fakedev::Route stall;
+    stall.mode = fakedev::Mode::Stall;
+    stall.body = Fixture("gmediarender_avtransport_scpd.xml");
+    device.SetRoute("/stall.xml", stall);
+    int rc = 0;
+    double seconds = 0;
+    std::thread downloader([&] {
+        IXML_Document *doc = nullptr;
+        auto start = std::chrono::steady_clock::now();
+        rc = XmlDownloadDoc((base + "/stall.xml").c_str(), &doc);
+        seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+        if (doc != nullptr)
+            ixmlDocument_free(doc);
+    });
+    ASSERT_TRUE(device.WaitFor("GET", "/stall.xml", 1, 5000));
+    XmlAbortDownloads(true);
+    downloader.join();
+    XmlAbortDownloads(false);
+    EXPECT_EQ(UPNP_E_CANCELED, rc);
+    EXPECT_LT(seconds, 5.0);  // the download alone would wait 10 s
+    // Downloads work again afterwards.
+    IXML_Document *doc = nullptr;
+    EXPECT_EQ(UPNP_E_SUCCESS, XmlDownloadDoc((base + "/rcs.xml").c_str(), &doc));
+    if (doc != nullptr)
+        ixmlDocument_free(doc);
 }
 
 }  // namespace
