@@ -125,13 +125,16 @@ TEST_F(SelectionTest, SelectedRendererLeavingTheNetwork)
     ASSERT_NE(nullptr, pub);
     EXPECT_EQ(0, pub->changed);
 
-    // A clean stop says bye-bye; the controller drops it, the loop drops its
-    // player and the selection.
-    kill(renderer, SIGTERM);
+    // Killed without a bye-bye: the next action sent to it fails and the
+    // controller drops it; the loop then drops its player and the
+    // selection.
+    kill(renderer, SIGKILL);
     h.WaitExit(renderer, 10000);
     renderer = -1;
+    ASSERT_EQ(0, h.Request(ACT_STOP, nullptr, &reply, 15000));
     ASSERT_TRUE(WaitUntil([&] { return Json("0 10", ACT_LIST_RENDERERS)["total"].asUInt() == 0; },
-                          15000));
+                          15000))
+        << Json("0 10", ACT_LIST_RENDERERS) << h.Log();
     EXPECT_TRUE(WaitUntil([&] { return pub->changed == 1; }, 5000));
     // No player selected: player actions do nothing and answer null.
     EXPECT_TRUE(Status().isNull());
