@@ -44,9 +44,18 @@ build_and_test build normal
 
 if [ "$QUICK" = "0" ]; then
     mkdir -p build-asan
-    export ASAN_OPTIONS="${ASAN_OPTIONS:-detect_leaks=1}"
-    export UBSAN_OPTIONS="${UBSAN_OPTIONS:-print_stacktrace=1}"
+    # The daemon sends its standard streams to /dev/null: sanitizer reports
+    # of every process go to files, which fail the stage when there are any.
+    rm -f build-asan/sanitizer.*
+    export ASAN_OPTIONS="${ASAN_OPTIONS:-detect_leaks=1}:log_path=$(pwd)/build-asan/sanitizer"
+    export UBSAN_OPTIONS="${UBSAN_OPTIONS:-print_stacktrace=1}:log_path=$(pwd)/build-asan/sanitizer"
     build_and_test build-asan asan -DTARN_SANITIZE=ON
+    if ls build-asan/sanitizer.* > /dev/null 2>&1; then
+        echo "asan: sanitizer reports:"
+        for f in build-asan/sanitizer.*; do echo "--- $f"; head -60 "$f"; done
+        failed="$failed asan-reports"
+    fi
+    unset ASAN_OPTIONS UBSAN_OPTIONS
 
     # ThreadSanitizer: only the tests labelled "upnp" (the code with threads).
     stage "tsan: tests labelled upnp"
