@@ -47,7 +47,10 @@ if [ "$INSIDE" = "0" ]; then
     fi
 fi
 
-BIN=$SRC/$TARN_BUILD_DIR/bin
+case "$TARN_BUILD_DIR" in
+    /*) BIN=$TARN_BUILD_DIR/bin ;;
+    *) BIN=$SRC/$TARN_BUILD_DIR/bin ;;
+esac
 MADE_ROOT=0
 if [ -z "$TARN_ROOT" ]; then
     TARN_ROOT=$(mktemp -d /tmp/tarn-run.XXXXXX) || exit 1
