@@ -3,10 +3,12 @@
 
 #include <cstring>
 #include <string>
+#include <unistd.h>
 
 #include <json/json.h>
 
 #include "daemon/ctrl.h"
+#include "daemon/socket.h"
 #include "daemon/tarn_types.h"
 #include "tests/harness/harness.h"
 
@@ -119,6 +121,17 @@ TEST_F(ClientsTest, TarnctlWithoutDaemonSaysHowToStartIt)
     EXPECT_EQ(1, h.Run({tarnctl, "watch", "--count", "1"}, &out));
     EXPECT_EQ(2, h.Run({tarnctl, "frobnicate"}, &out));
     EXPECT_NE(std::string::npos, out.find("usage:")) << out;
+}
+
+TEST_F(ClientsTest, TarnctlReportsADaemonThatDoesNotAnswer)
+{
+    // Something listens on the control socket but never serves it.
+    int fd = SocketListen(h.Path(TARN_CTRL_SOCKET).c_str(), 5);
+    ASSERT_GE(fd, 0);
+    std::string out;
+    EXPECT_EQ(1, h.Run({tarnctl, "--timeout", "300", "status"}, &out));
+    EXPECT_NE(std::string::npos, out.find("did not answer within 300 ms")) << out;
+    close(fd);
 }
 
 TEST_F(ClientsTest, TarnctlDrivesTheQueueAndShowsStatus)
