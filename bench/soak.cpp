@@ -1,17 +1,19 @@
 // Soak: 32 concurrent control clients against the real tarnaudiod in a
 // private root, valid requests of every kind mixed with hostile clients.
 //
-//   bench_soak            about 2.5 minutes
-//   bench_soak --quick    about 30 seconds
+//   bench_soak            about 3 minutes
+//   bench_soak --quick    about 40 seconds
 //   bench_soak --clients N --seconds S
 //
 // Runs only in a private network namespace (scripts/netns-run): the daemon
 // sends SSDP searches at start.
 //
 // Phases:
-//   warm-up  mixed load, then the queue is filled with as many songs as the
-//            counted phase may add, and everything is stopped and cleared;
-//            the daemon's descriptors and RSS are taken as the baseline.
+//   warm-up  a short mixed phase, then a counted phase that lasts until
+//            every client has made its adds (the queue's peak size and the
+//            heap's shape are those of the measured run); then everything
+//            is stopped and cleared and the daemon's descriptors and RSS
+//            are taken as the baseline.
 //   mixed    every action code, source changes, removes and clears
 //            included, plus hostile clients.
 //   counted  the queue is cleared once; then only requests that leave the
@@ -296,6 +298,7 @@ struct ClientConfig {
     long endMs;
     int maxAdds;        // counted phase: adds and inserts per client
     double hostileShare;
+    bool untilAddsDone; // counted phase: a client ends once its adds are done
 };
 
 void Client(int index, ClientConfig cfg)
@@ -304,7 +307,7 @@ void Client(int index, ClientConfig cfg)
     int adds = 0;
     bool ownAddAnswered = false;
     uint32_t nextId = static_cast<uint32_t>(index + 1) * 100000u;
-    while (NowMs() < cfg.endMs) {
+    while (NowMs() < cfg.endMs && !(cfg.untilAddsDone && adds >= cfg.maxAdds)) {
         if (std::uniform_real_distribution<double>(0, 1)(rng) < cfg.hostileShare) {
             Hostile(static_cast<int>(rng() % 5), rng);
             continue;
@@ -360,11 +363,15 @@ void RunPhase(tarntest::Harness &h, int clients, ClientConfig cfg, const char *n
     printf("soak: %s phase, %d clients, %ld s\n", name, clients, (cfg.endMs - NowMs()) / 1000);
     fflush(stdout);
     std::vector<std::thread> threads;
+    std::atomic<int> running(clients);
     for (int i = 0; i < clients; i++)
-        threads.emplace_back(Client, i, cfg);
+        threads.emplace_back([i, cfg, &running] {
+            Client(i, cfg);
+            running--;
+        });
     // The daemon's mplayer-daemon processes are adopted by this process.
     long lastShown = NowMs();
-    while (NowMs() < cfg.endMs) {
+    while (NowMs() < cfg.endMs && running > 0) {
         h.Reap();
         usleep(100 * 1000);
         if (NowMs() - lastShown >= 10000) {
@@ -476,7 +483,7 @@ int main(int argc, char **argv)
     int seconds = 150;
     for (int i = 1; i < argc; i++) {
         if (!strcmp(argv[i], "--quick"))
-            seconds = 30;
+            seconds = 20;
         else if (!strcmp(argv[i], "--clients") && i + 1 < argc)
             clients = std::max(1, std::min(256, atoi(argv[++i])));
         else if (!strcmp(argv[i], "--seconds") && i + 1 < argc)
@@ -490,12 +497,14 @@ int main(int argc, char **argv)
         fprintf(stderr, "bench_soak: run it under scripts/netns-run (the daemon sends SSDP searches)\n");
         return 2;
     }
-    // Split: 15% warm-up, 35% mixed, 50% counted.
-    int warmSecs = std::max(3, seconds * 15 / 100);
-    int mixedSecs = std::max(4, seconds * 35 / 100);
+    // Split: 10% mixed warm-up (the adds of the warm-up take what they
+    // take), 40% mixed, 50% counted.
+    int warmSecs = std::max(3, seconds * 10 / 100);
+    int mixedSecs = std::max(4, seconds * 40 / 100);
     int countedSecs = std::max(6, seconds - warmSecs - mixedSecs);
     const double hostileShare = 0.10;
-    const int maxAdds = 40;
+    // Adds per client in each counted phase (the queue's peak size).
+    const int maxAdds = seconds >= 120 ? 20 : 4;
 
     tarntest::Harness h;
     for (int i = 0; i < 4; i++) {
@@ -518,14 +527,19 @@ int main(int argc, char **argv)
            h.Root().c_str(), clients, warmSecs + mixedSecs + countedSecs, warmSecs, mixedSecs,
            countedSecs);
 
-    // Warm-up: mixed load, then the queue at its largest counted size.
-    RunPhase(h, clients, {PHASE_MIXED, NowMs() + warmSecs * 1000L, 0, hostileShare}, "warm-up");
+    // Warm-up: the same two phases as the measured run, the counted one
+    // until every client has made all its adds, so that the queue reaches
+    // the same size and the heap the same shape as in the measured run.
+    RunPhase(h, clients, {PHASE_MIXED, NowMs() + warmSecs * 1000L, 0, hostileShare, false}, "warm-up (mixed)");
     Settle(h);
-    for (int i = 0; i < clients * maxAdds; i++) {
-        ControlRequest req = SongRequest(ACT_QUEUE_ADD, 900000000u + i, 0);
-        h.RequestRaw(req, nullptr, 5000);
+    RunPhase(h, clients, {PHASE_COUNTED, NowMs() + 300 * 1000L, maxAdds, hostileShare, true},
+             "warm-up (adds)");
+    Settle(h);
+    {
+        std::lock_guard<std::mutex> lock(g_stats.m);
+        g_stats.addedIds.clear();
+        g_stats.addsAnswered = 0;
     }
-    Settle(h);
     int fds0 = tarntest::CountFds(pid);
     long rss0 = RssKb(pid);
     long warmValid;
@@ -537,7 +551,7 @@ int main(int argc, char **argv)
            rss0, warmValid);
 
     long t0 = NowMs();
-    RunPhase(h, clients, {PHASE_MIXED, NowMs() + mixedSecs * 1000L, 0, hostileShare}, "mixed");
+    RunPhase(h, clients, {PHASE_MIXED, NowMs() + mixedSecs * 1000L, 0, hostileShare, false}, "mixed");
     Settle(h);
     {
         std::string r;
@@ -546,7 +560,7 @@ int main(int argc, char **argv)
         if (ReadQueue(h, &ids, &total) != 0 || total != 0)
             printf("soak: queue not empty before the counted phase (%d)\n", total);
     }
-    RunPhase(h, clients, {PHASE_COUNTED, NowMs() + countedSecs * 1000L, maxAdds, hostileShare},
+    RunPhase(h, clients, {PHASE_COUNTED, NowMs() + countedSecs * 1000L, maxAdds, hostileShare, false},
              "counted");
     long elapsed = NowMs() - t0;
 
