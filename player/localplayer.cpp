@@ -99,7 +99,7 @@ int LocalPlayer::AttachMplayerFd(int fd)
 int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
 {
     if (!request) {
-        TLOG("Bad parameter");
+        TarnLog("%s:%d Bad parameter", kLogUnit, 523);
         return -1;
     }
     // The text parameter is NUL-terminated by the client; never read past
@@ -157,7 +157,7 @@ int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
         SetEqualizer(text);
         break;
     default:
-        TLOG("Action [%d] not handled", request->action);
+        TarnLog("%s:%d Action [%d] not handled", kLogUnit, 576, request->action);
         return -1;
     }
     return 0;

@@ -456,7 +456,7 @@ int Playlist::HandleAction(const ControlRequest *request, Json::Value &reply)
         ToggleRepeatMode();
         break;
     default:
-        TLOG("Action [%d] not handled", request->action);
+        TarnLog("%s:%d Action [%d] not handled", kLogUnit, 567, request->action);
         return -1;
     }
     return 0;
