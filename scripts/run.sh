@@ -58,12 +58,19 @@ if [ -z "$TARN_ROOT" ]; then
 fi
 export TARN_ROOT
 export TARN_LOG_FILE=${TARN_LOG_FILE:-$TARN_ROOT/log.txt}
-[ "$INSIDE" = "1" ] && export TARN_AUDIO_OUT=${TARN_AUDIO_OUT:-null}
+# Inside the private namespace (our machines have no speakers) the music is
+# written to a WAV file that can be played afterwards.
+[ "$INSIDE" = "1" ] && export TARN_AUDIO_OUT=${TARN_AUDIO_OUT:-wav:/tmp/tarn-demo.wav}
 mkdir -p "$TARN_ROOT/tmp" "$TARN_ROOT/var/run" "$TARN_ROOT/etc" "$TARN_ROOT/usr/tarn/bin" \
     "$TARN_ROOT/usr/tarn/etc/audio" "$TARN_ROOT/usr/tarn/etc.defaults/audio"
 if [ -x "$BIN/mplayer-daemon" ]; then
     cp "$BIN/mplayer-daemon" "$TARN_ROOT/usr/tarn/bin/mplayer-daemon"
 fi
+# The appliance's default data: equalizer profiles and the radio seed lists.
+cp data/equalizer.system "$TARN_ROOT/usr/tarn/etc.defaults/audio/equalizer.system"
+cp data/radio/*.asx "$TARN_ROOT/usr/tarn/etc/audio/" 2>/dev/null
+CONF=$TARN_ROOT/etc/tarninfo.conf
+grep -q '^admin_port=' "$CONF" 2>/dev/null || echo "admin_port=${TARN_WEB_PORT:-8580}" >> "$CONF"
 echo "run: root $TARN_ROOT"
 
 PIDFILE=$TARN_ROOT/var/run/tarnaudiod.pid
@@ -81,6 +88,28 @@ until [ -S "$SOCK" ] && "$BIN/tarnctl" status > /dev/null 2>&1; do
 done
 echo "run: tarnaudiod running, pid $(cat "$PIDFILE")"
 echo "run: tarnctl status"
+"$BIN/tarnctl" status
+
+# The song server that renderers fetch the queue's songs from.
+"$BIN/tarnweb" > "$TARN_ROOT/tarnweb.log" 2>&1 &
+WEBPID=$!
+echo "run: song server tarnweb on port $(sed -n 's/^admin_port=//p' "$CONF"), pid $WEBPID"
+
+# Demo music: a few short tagged songs, scanned into the media library, then
+# a random selection of the library queued and played.
+MUSIC=$TARN_ROOT/music
+echo "run: making demo songs in $MUSIC"
+scripts/make-demo-songs.sh "$MUSIC" "${TARN_DEMO_SECONDS:-6}" > /dev/null ||
+    echo "run: could not make demo songs (needs sox, lame, flac, vorbis-tools: scripts/setup.sh)"
+echo "run: tarnlib scan $MUSIC"
+"$BIN/tarnlib" scan "$MUSIC"
+echo "run: tarnctl source random"
+"$BIN/tarnctl" source random
+"$BIN/tarnctl" queue
+echo "run: audio output: ${TARN_AUDIO_OUT:-default}"
+echo "run: tarnctl watch (live status from the status segment)"
+"$BIN/tarnctl" watch --count "${TARN_DEMO_WATCH:-44}" --interval 500
+echo
 "$BIN/tarnctl" status
 
 stop_daemon() {
@@ -101,11 +130,15 @@ if [ "$KEEP" = "1" ] && [ "$INSIDE" = "0" ]; then
     echo "run: left running. Use it with:"
     echo "  export TARN_ROOT=$TARN_ROOT"
     echo "  $TARN_BUILD_DIR/bin/tarnctl status"
-    echo "  kill \$(cat $PIDFILE)    # to stop it"
+    echo "  kill \$(cat $PIDFILE) $WEBPID    # to stop the daemon and the song server"
     exit 0
 fi
 stop_daemon
 status=$?
+kill "$WEBPID" 2>/dev/null && wait "$WEBPID" 2>/dev/null
+case "$TARN_AUDIO_OUT" in
+    wav:*) echo "run: the music that played is in ${TARN_AUDIO_OUT#wav:}" ;;
+esac
 echo "run: daemon log ($TARN_LOG_FILE):"
 sed 's/^/  /' "$TARN_LOG_FILE" 2>/dev/null
 [ "$status" = "0" ] && [ "$MADE_ROOT" = "1" ] && rm -rf "$TARN_ROOT"
