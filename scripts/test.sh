@@ -5,6 +5,7 @@
 #   3. build-asan/  AddressSanitizer + UndefinedBehaviorSanitizer build, its ctest
 #   4. build-tsan/  ThreadSanitizer build of the tests labelled "upnp" (when any)
 #   5. a short fuzz run of each target in fuzz/ (when there are any)
+#   6. bench/compare --quick (the side-by-side benchmark, about a minute)
 # Every stage runs even when an earlier one failed; the summary at the end
 # names the failed stages and the exit status is non-zero if any failed.
 #   scripts/test.sh            everything
@@ -84,6 +85,12 @@ if [ "$QUICK" = "0" ]; then
     else
         echo "fuzz: no targets in fuzz/"
     fi
+fi
+
+if [ "$QUICK" = "0" ]; then
+    # Keeps the side-by-side benchmark working; its figures are not judged.
+    stage "benchmark smoke: bench/compare --quick"
+    bench/compare --quick || failed="$failed bench-compare"
 fi
 
 echo
