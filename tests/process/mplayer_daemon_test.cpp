@@ -329,6 +329,8 @@ TEST_F(MplayerDaemonTest, UnplayableSongIsReportedAsEnded)
     EXPECT_EQ(seg_.Uri(), bad);
     ASSERT_TRUE(sock_.Load(Media("missing.mp3")));
     ExpectEndAndAck(8000);
+    ASSERT_TRUE(sock_.Load("http://127.0.0.1:1/station"));  // nobody listens there
+    ExpectEndAndAck(8000);
     ASSERT_TRUE(sock_.Load(good));
     ExpectPlaying(good, 2);
     ExpectEndAndAck(8000);
@@ -337,6 +339,7 @@ TEST_F(MplayerDaemonTest, UnplayableSongIsReportedAsEnded)
     std::string log = ReadFile(root_.Path("/log.txt"));
     EXPECT_NE(log.find("Failed to play [" + bad + "]"), std::string::npos) << log;
     EXPECT_NE(log.find("missing.mp3"), std::string::npos) << log;
+    EXPECT_NE(log.find("127.0.0.1:1/station"), std::string::npos) << log;
 }
 
 }  // namespace

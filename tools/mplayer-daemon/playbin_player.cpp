@@ -433,7 +433,7 @@ void PlaybinPlayer::HandleError(GstMessage *msg)
         TLOG("Failed to play [%s]: %s", uriText_.c_str(), err ? err->message : "unknown error");
         mode_ = ENDED;
         StopTimers();
-        gst_element_set_state(playbin_, GST_STATE_READY);
+        gst_element_set_state(playbin_, GST_STATE_NULL);
         failId_ = g_timeout_add(kFailedSongDelayMs, &PlaybinPlayer::OnFailedSongEnd, this);
     }
     g_clear_error(&err);
