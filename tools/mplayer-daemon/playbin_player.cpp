@@ -239,7 +239,19 @@ int PlaybinPlayer::Load(const std::string &uriText)
     }
     g_object_set(playbin_, "uri", uri.c_str(), nullptr);
     if (gst_element_set_state(playbin_, GST_STATE_PLAYING) == GST_STATE_CHANGE_FAILURE) {
-        // The error message on the bus says why; it ends the song there.
+        // The element that failed has posted why; end the song with it.
+        GstBus *b = gst_element_get_bus(playbin_);
+        GstMessage *msg = gst_bus_pop_filtered(b, GST_MESSAGE_ERROR);
+        gst_object_unref(b);
+        if (msg) {
+            HandleError(msg);
+            gst_message_unref(msg);
+        } else {
+            TLOG("Failed to start playing [%s].", uriText.c_str());
+            mode_ = ENDED;
+            gst_element_set_state(playbin_, GST_STATE_NULL);
+            failId_ = g_timeout_add(kFailedSongDelayMs, &PlaybinPlayer::OnFailedSongEnd, this);
+        }
         return -1;
     }
     StartTick();
