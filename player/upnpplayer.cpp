@@ -53,7 +53,8 @@ UpnpPlayer::UpnpPlayer(UpnpController *controller, int rendererIndex)
       renderer(nullptr),
       lastSendGetInfo(time(nullptr)),
       lastCheckState(lastSendGetInfo),
-      playStarted(0)
+      playStarted(0),
+      replayPending(0)
 {
     if (!controller || rendererIndex < 0 ||
         controller->GetRenderer(static_cast<unsigned>(rendererIndex), &renderer) != 0 || !renderer) {
@@ -266,11 +267,18 @@ int UpnpPlayer::Stop()
 int UpnpPlayer::Next(bool automatic)
 {
     if (automatic && playlist->GetMode() == 2) {
-        // The renderer still holds the song: play it again.
-        if (controller->Play() != 0)
-            TLOG("Failed to send upnp play");
-        else
-            SetState(PLAYER_STATE_PLAYING);
+        if (!replayPending) {
+            // The renderer still holds the song: play it again.
+            if (controller->Play() != 0)
+                TLOG("Failed to send upnp play");
+            else
+                replayPending = 1;
+            return -1;
+        }
+        // Still stopped one check after that Play: this renderer forgot the
+        // song at its end (some clear their URI), so it is given again.
+        replayPending = 0;
+        PlayCurrent();
         return -1;
     }
     std::string uri;
@@ -357,6 +365,8 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     const char *text = request->parameter;
     int result = 0;
     controller->Lock();
+    if (code >= ACT_PLAY_PAUSE && code <= ACT_SEEK)
+        replayPending = 0;
     // The record may have been replaced since the last turn.
     RENDERER_INFO *r = nullptr;
     int index = controller->FindRendererByUdn(udn);
@@ -439,6 +449,8 @@ int UpnpPlayer::Poll()
     if (s == PLAYER_STATE_NONE)
         return 0;
     state = s;
+    if (s != PLAYER_STATE_STOPPED)
+        replayPending = 0;
     mute = strtol(r->mute.c_str(), nullptr, 10) != 0;
     volume = static_cast<int32_t>(strtol(r->volume.c_str(), nullptr, 10));
 

@@ -58,6 +58,9 @@ private:
     time_t lastCheckState;
     int32_t playStarted;
     std::string host;
+    // 1 after "Repeat One" sent Play at a song's end, until the renderer
+    // reports anything but STOPPED.
+    int32_t replayPending;
 };
 
 #endif

@@ -106,9 +106,21 @@ int Fetches(int i)
     return n;
 }
 
+// The renderer's own log, without its list of supported types.
+std::string RendererLog()
+{
+    std::istringstream in(g->h->ReadFile("/tmp/gmediarender.log"));
+    std::string line, out;
+    while (std::getline(in, line))
+        if (line.find("Registering support") == std::string::npos)
+            out += line + "\n";
+    return out;
+}
+
 void QueueSongs()
 {
     Ask(ACT_QUEUE_CLEAR);
+    Ask(ACT_SET_REPEAT_MODE, "1");
     for (const MediaSong &s : g->songs) {
         TARN_MEDIA_INFO info;
         MediaSongToInfo(s, &info);
@@ -155,7 +167,7 @@ protected:
                 deviceIface.c_str());
         g->renderer = h.Spawn({"/usr/bin/gmediarender", "-I", deviceIface, "-p", "49494", "-f",
                                kRendererName, "-u", kRendererUuid, "--gstout-audiopipe",
-                               "fakesink sync=true"});
+                               "fakesink sync=true", "--logfile", h.Path("/tmp/gmediarender.log")});
         if (g->renderer <= 0) {
             g->setupError = "gmediarender did not start";
             return;
@@ -319,11 +331,23 @@ TEST_F(RendererPlayback, RepeatOneReplaysTheSameSongWithoutLoadingAnother)
                            (kSongSeconds + 5) * 1000, &s)) << s;
     ASSERT_TRUE(WaitStatus([](const Json::Value &v) {
         return v["TransportState"] == "PLAYING" && v["RelTime"].asInt() <= 4 && v["RelTime"].asInt() >= 1;
-    }, 25000, &s)) << s;
+    }, 30000, &s)) << s << RendererLog();
     EXPECT_TRUE(IsSong(s, 0)) << s;
     EXPECT_GT(Fetches(0), fetches0 + 1) << "the replay did not fetch the song again";
     EXPECT_EQ(fetches1, Fetches(1));
-    Ask(ACT_SET_REPEAT_MODE, "1");
+
+    // At the end the renderer was first told only to play again. This
+    // renderer forgets its song at the end and refuses that; only then is
+    // the song given to it again.
+    std::string log = RendererLog();
+    size_t end = log.rfind("End-of-stream");
+    ASSERT_NE(std::string::npos, end) << log;
+    size_t refused = log.find("Playing failed", end);
+    size_t reload = log.find("AVTransportURI: http", end);
+    ASSERT_NE(std::string::npos, reload) << log;
+    if (refused != std::string::npos) {
+        EXPECT_LT(refused, reload) << log;
+    }
     Ask(ACT_STOP);
 }
 
@@ -333,11 +357,11 @@ TEST_F(RendererPlayback, StatusReplyAndPublishedSegmentFollowTheRenderer)
     Ask(ACT_PLAY_INDEX, "2");
     Json::Value s;
     ASSERT_TRUE(WaitStatus([](const Json::Value &v) {
-        return IsSong(v, 2) && v["TransportState"] == "PLAYING" && v["Duration"].asInt() > 0;
+        return IsSong(v, 2) && v["TransportState"] == "PLAYING" &&
+               std::abs(v["Duration"].asInt() - kSongSeconds) <= 1;
     }, 20000, &s)) << s;
     EXPECT_EQ(kRendererName, s["RendererFriendlyName"].asString());
     EXPECT_EQ(g->rendererIndex, s["RendererIndex"].asInt());
-    EXPECT_NEAR(kSongSeconds, s["Duration"].asInt(), 1);
     EXPECT_TRUE(s.isMember("last_send_get_info"));
     EXPECT_TRUE(s.isMember("last_check_state"));
 
