@@ -352,8 +352,27 @@ int UpnpController::OnUpnpEvent(Upnp_EventType type, const void *event, void *co
     if (self == nullptr)
         return -1;
     switch (type) {
-    case UPNP_CONTROL_ACTION_COMPLETE:
-        return self->OnActionComplete(static_cast<const UpnpActionComplete *>(event));
+    case UPNP_CONTROL_ACTION_COMPLETE: {
+        const UpnpActionComplete *done = static_cast<const UpnpActionComplete *>(event);
+        int rc = self->OnActionComplete(done);
+#if UPNP_VERSION < 11416
+        // libupnp before 1.14.16 hands its copy of the action and the answer
+        // to this callback and never frees either: without this every
+        // asynchronous action (two a second while a renderer plays) leaks.
+        if (done != nullptr) {
+            UpnpActionComplete *owned = const_cast<UpnpActionComplete *>(done);
+            IXML_Document *request = UpnpActionComplete_get_ActionRequest(done);
+            IXML_Document *result = UpnpActionComplete_get_ActionResult(done);
+            UpnpActionComplete_set_ActionRequest(owned, nullptr);
+            UpnpActionComplete_set_ActionResult(owned, nullptr);
+            if (request != nullptr)
+                ixmlDocument_free(request);
+            if (result != nullptr)
+                ixmlDocument_free(result);
+        }
+#endif
+        return rc;
+    }
     case UPNP_DISCOVERY_ADVERTISEMENT_ALIVE:
     case UPNP_DISCOVERY_SEARCH_RESULT:
         self->OnDiscovery(static_cast<const UpnpDiscovery *>(event));
