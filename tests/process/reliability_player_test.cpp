@@ -199,7 +199,7 @@ TEST_F(PlayerFaults, StoppedPlayerNeverHoldsTheLoop)
         worst = std::max(worst, ms);
     }
     EXPECT_LT(worst, 1000);
-    RecordProperty("worst_ms", static_cast<int>(worst));
+    printf("400 requests to a stopped player's daemon: slowest reply %ld ms\n", worst);
 
     ASSERT_EQ(0, kill(pid, SIGCONT));
     // The player was never dropped for being slow; it takes commands again.
