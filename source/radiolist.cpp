@@ -249,6 +249,31 @@ int ShoutcastListGetByGenre(const char *genre, Json::Value &list, bool force)
     return ShoutcastListGet(index, list, force);
 }
 
+// The styled writer writes a member name only up to its first NUL byte: a
+// name such as "stations\0..." read from a damaged file would come out as a
+// second "stations" member and, read back, shadow the real one (the edit
+// just saved would be lost). Such members are left out of what is written.
+static Json::Value WithoutNulNames(const Json::Value &value)
+{
+    if (value.isObject()) {
+        Json::Value out(Json::objectValue);
+        for (Json::ValueConstIterator it = value.begin(); it != value.end(); ++it) {
+            std::string name = it.name();
+            if (name.find('\0') != std::string::npos)
+                continue;
+            out[name] = WithoutNulNames(*it);
+        }
+        return out;
+    }
+    if (value.isArray()) {
+        Json::Value out(Json::arrayValue);
+        for (Json::ArrayIndex i = 0; i < value.size(); i++)
+            out.append(WithoutNulNames(value[i]));
+        return out;
+    }
+    return value;
+}
+
 int RadioListSave(const char *path, const Json::Value &list)
 {
     if (!path) {
@@ -256,7 +281,7 @@ int RadioListSave(const char *path, const Json::Value &list)
         return -1;
     }
     Json::StyledWriter writer;
-    std::string text = writer.write(list);
+    std::string text = writer.write(WithoutNulNames(list));
 
     // The text goes to a temporary file beside the list, which replaces the
     // list only once it is complete: a full disk leaves the old list intact.
