@@ -340,9 +340,11 @@ private:
         }
         case Mode::Close:
             break;
-        case Mode::Garbage:
-            SendAll(fd, std::string("\x01\x02 this is not http \xff\xfe\r\n\r\n", 28) + route.body);
+        case Mode::Garbage: {
+            static const char kJunk[] = "\x01\x02 this is not http \xff\xfe\r\n\r\n";
+            SendAll(fd, std::string(kJunk, sizeof(kJunk) - 1) + route.body);
             break;
+        }
         case Mode::Trickle:
             SendAll(fd, Head(route.status, route.contentType, route.body.size()));
             for (char c : route.body) {
