@@ -282,6 +282,9 @@ TEST_F(RendererPlayback, PauseResumeSeekVolumeAndMuteReachTheRenderer)
         return v["RelTime"].asInt() >= 1 && v["RelTime"].asInt() <= 3;
     }, 5000, &s)) << s;
 
+    // The renderer announces only changes: start from a known volume.
+    Ask(ACT_SET_VOLUME, "50");
+    EXPECT_TRUE(WaitStatus([](const Json::Value &v) { return v["Volume"] == "50"; }, 5000, &s)) << s;
     Ask(ACT_SET_VOLUME, "150");  // clamped to 100
     EXPECT_TRUE(WaitStatus([](const Json::Value &v) { return v["Volume"] == "100"; }, 5000, &s)) << s;
     Ask(ACT_SET_VOLUME, "30");
