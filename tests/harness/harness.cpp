@@ -7,8 +7,9 @@
 #include <cstring>
 #include <ctime>
 #include <dirent.h>
+#include <filesystem>
+#include <fstream>
 #include <fcntl.h>
-#include <ftw.h>
 #include <poll.h>
 #include <sys/ipc.h>
 #include <sys/prctl.h>
@@ -40,26 +41,12 @@ void SleepMs(int ms)
     usleep(static_cast<useconds_t>(ms) * 1000);
 }
 
-int RemoveEntry(const char *path, const struct stat *, int, struct FTW *)
-{
-    remove(path);
-    return 0;
-}
-
 // Empties a directory tree (the directory itself stays).
 void EmptyDir(const std::string &dir)
 {
-    DIR *d = opendir(dir.c_str());
-    if (!d)
-        return;
-    std::vector<std::string> names;
-    while (struct dirent *e = readdir(d)) {
-        if (strcmp(e->d_name, ".") && strcmp(e->d_name, ".."))
-            names.push_back(dir + "/" + e->d_name);
-    }
-    closedir(d);
-    for (const std::string &n : names)
-        nftw(n.c_str(), RemoveEntry, 16, FTW_DEPTH | FTW_PHYS);
+    std::error_code ec;
+    for (const auto &e : std::filesystem::directory_iterator(dir, ec))
+        std::filesystem::remove_all(e.path(), ec);
 }
 
 void RemoveProcessRoot()
@@ -72,56 +59,15 @@ void RemoveProcessRoot()
 
 int MakeDirs(const std::string &path)
 {
-    std::string cur;
-    size_t pos = 0;
-    while (pos != std::string::npos) {
-        pos = path.find('/', pos + 1);
-        cur = path.substr(0, pos);
-        if (!cur.empty() && mkdir(cur.c_str(), 0755) != 0 && errno != EEXIST)
-            return -1;
-    }
-    return 0;
-}
-
-int CopyFile(const std::string &from, const std::string &to, mode_t mode)
-{
-    int in = open(from.c_str(), O_RDONLY | O_CLOEXEC);
-    if (in < 0)
-        return -1;
-    int out = open(to.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
-    if (out < 0) {
-        close(in);
-        return -1;
-    }
-    char buf[65536];
-    ssize_t n;
-    int rc = 0;
-    while ((n = read(in, buf, sizeof(buf))) > 0) {
-        if (write(out, buf, static_cast<size_t>(n)) != n) {
-            rc = -1;
-            break;
-        }
-    }
-    if (n < 0)
-        rc = -1;
-    close(in);
-    if (close(out) != 0)
-        rc = -1;
-    return rc;
+    std::error_code ec;
+    std::filesystem::create_directories(path, ec);
+    return std::filesystem::is_directory(path, ec) ? 0 : -1;
 }
 
 std::string ReadAll(const std::string &path)
 {
-    std::string out;
-    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0)
-        return out;
-    char buf[65536];
-    ssize_t n;
-    while ((n = read(fd, buf, sizeof(buf))) > 0)
-        out.append(buf, static_cast<size_t>(n));
-    close(fd);
-    return out;
+    std::ifstream in(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
 void RemoveSegment(int key)
@@ -138,6 +84,24 @@ void *AttachSegment(int key, size_t size, bool readOnly)
         return nullptr;
     void *p = shmat(id, nullptr, readOnly ? SHM_RDONLY : 0);
     return p == reinterpret_cast<void *>(-1) ? nullptr : p;
+}
+
+// What comes on fd until it is closed or the deadline passes.
+std::string ReadUntilClosed(int fd, long end)
+{
+    std::string data;
+    for (long left; (left = end - NowMs()) > 0;) {
+        struct pollfd p = {fd, POLLIN, 0};
+        int r = poll(&p, 1, static_cast<int>(left));
+        if (r < 0 && errno == EINTR)
+            continue;
+        char buf[8192];
+        ssize_t n = r > 0 ? read(fd, buf, sizeof(buf)) : 0;
+        if (n <= 0)
+            break;
+        data.append(buf, static_cast<size_t>(n));
+    }
+    return data;
 }
 
 }  // namespace
@@ -263,8 +227,9 @@ void Harness::PrepareRoot()
     for (const char *d : dirs)
         MakeDirs(root + d);
     std::string mplayer = BinPath("mplayer-daemon");
+    std::error_code ec;
     if (access(mplayer.c_str(), X_OK) == 0)
-        CopyFile(mplayer, Path(TARN_MPLAYER_BIN), 0755);
+        std::filesystem::copy_file(mplayer, Path(TARN_MPLAYER_BIN), ec);
 }
 
 std::string Harness::Path(const char *fixedPath) const
@@ -275,15 +240,12 @@ std::string Harness::Path(const char *fixedPath) const
 int Harness::WriteFile(const char *fixedPath, const std::string &content) const
 {
     std::string p = Path(fixedPath);
-    size_t slash = p.rfind('/');
-    if (slash != std::string::npos && MakeDirs(p.substr(0, slash)) != 0)
+    if (MakeDirs(p.substr(0, p.rfind('/'))) != 0)
         return -1;
-    int fd = open(p.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-    if (fd < 0)
-        return -1;
-    ssize_t w = write(fd, content.data(), content.size());
-    close(fd);
-    return w == static_cast<ssize_t>(content.size()) ? 0 : -1;
+    std::ofstream out(p, std::ios::binary | std::ios::trunc);
+    out << content;
+    out.close();
+    return out ? 0 : -1;
 }
 
 std::string Harness::ReadFile(const char *fixedPath) const
@@ -334,16 +296,35 @@ int Harness::WaitAllChildren(int timeoutMs)
     for (;;) {
         int status = 0;
         pid_t p = waitpid(-1, &status, WNOHANG);
-        if (p > 0) {
+        if (p > 0)
             reaped[p] = status;
-            continue;
-        }
-        if (p < 0 && errno == ECHILD)
+        else if (p < 0 && errno == ECHILD)
             return 0;
-        if (NowMs() >= end)
+        else if (NowMs() >= end)
             return -1;
-        SleepMs(5);
+        else
+            SleepMs(5);
     }
+}
+
+// Forks and execs argv with stdout and stderr on outFd (-1: /dev/null, -2: kept).
+static pid_t ForkExec(const std::vector<std::string> &argv, int outFd)
+{
+    std::vector<char *> args;
+    for (const std::string &a : argv)
+        args.push_back(const_cast<char *>(a.c_str()));
+    args.push_back(nullptr);
+    pid_t pid = fork();
+    if (pid == 0) {
+        int fd = outFd == -1 ? open("/dev/null", O_RDWR) : outFd;
+        if (fd >= 0) {
+            dup2(fd, 1);
+            dup2(fd, 2);
+        }
+        execv(args[0], args.data());
+        _exit(127);
+    }
+    return pid;
 }
 
 pid_t Harness::Spawn(const std::vector<std::string> &argv, bool quiet)
@@ -353,78 +334,25 @@ pid_t Harness::Spawn(const std::vector<std::string> &argv, bool quiet)
                 "(run under scripts/netns-run)";
         return -1;
     }
-    if (argv.empty())
-        return -1;
-    std::vector<char *> args;
-    for (const std::string &a : argv)
-        args.push_back(const_cast<char *>(a.c_str()));
-    args.push_back(nullptr);
-    pid_t pid = fork();
-    if (pid < 0)
-        return -1;
-    if (pid == 0) {
-        if (quiet) {
-            int devnull = open("/dev/null", O_RDWR);
-            if (devnull >= 0) {
-                dup2(devnull, 1);
-                dup2(devnull, 2);
-            }
-        }
-        execv(args[0], args.data());
-        _exit(127);
-    }
-    return pid;
+    return argv.empty() ? -1 : ForkExec(argv, quiet ? -1 : -2);
 }
 
 int Harness::Run(const std::vector<std::string> &argv, std::string *out, int timeoutMs)
 {
-    if (!InPrivateNetns()) {
-        error = "refusing to start programs outside a private network namespace "
-                "(run under scripts/netns-run)";
-        return -1;
-    }
-    if (argv.empty())
-        return -1;
     int fds[2];
-    if (pipe2(fds, O_CLOEXEC) != 0)
+    if (argv.empty() || pipe2(fds, O_CLOEXEC) != 0)
         return -1;
-    std::vector<char *> args;
-    for (const std::string &a : argv)
-        args.push_back(const_cast<char *>(a.c_str()));
-    args.push_back(nullptr);
-    pid_t pid = fork();
+    pid_t pid = InPrivateNetns() ? ForkExec(argv, fds[1]) : -1;
+    close(fds[1]);
     if (pid < 0) {
         close(fds[0]);
-        close(fds[1]);
+        if (error.empty())
+            error = "refusing to start programs outside a private network namespace";
         return -1;
     }
-    if (pid == 0) {
-        dup2(fds[1], 1);
-        dup2(fds[1], 2);
-        execv(args[0], args.data());
-        _exit(127);
-    }
-    close(fds[1]);
-    std::string text;
     long end = NowMs() + timeoutMs;
-    // Read until the program and every process that inherited its output
-    // (a daemonizing child sends its streams to /dev/null) closed the pipe.
-    for (;;) {
-        long left = end - NowMs();
-        if (left <= 0)
-            break;
-        struct pollfd p = {fds[0], POLLIN, 0};
-        int r = poll(&p, 1, static_cast<int>(left));
-        if (r < 0 && errno == EINTR)
-            continue;
-        if (r <= 0)
-            break;
-        char buf[4096];
-        ssize_t n = read(fds[0], buf, sizeof(buf));
-        if (n <= 0)
-            break;
-        text.append(buf, static_cast<size_t>(n));
-    }
+    // Until every holder of the pipe closed it (a daemonizing child lets go).
+    std::string text = ReadUntilClosed(fds[0], end);
     close(fds[0]);
     if (out)
         *out = text;
@@ -535,24 +463,7 @@ int Harness::SendBytes(const void *bytes, size_t length, std::string *reply, int
         close(fd);
         return -1;
     }
-    std::string data;
-    long end = NowMs() + timeoutMs;
-    for (;;) {
-        long left = end - NowMs();
-        if (left <= 0)
-            break;
-        struct pollfd p = {fd, POLLIN, 0};
-        int r = poll(&p, 1, static_cast<int>(left));
-        if (r < 0 && errno == EINTR)
-            continue;
-        if (r <= 0)
-            break;
-        char buf[8192];
-        ssize_t n = read(fd, buf, sizeof(buf));
-        if (n <= 0)
-            break;
-        data.append(buf, static_cast<size_t>(n));
-    }
+    std::string data = ReadUntilClosed(fd, NowMs() + timeoutMs);
     close(fd);
     if (received)
         *received = data.size();
@@ -637,37 +548,26 @@ int Harness::PublishedKey() const
     return TarnShmKeyPublished();
 }
 
+template <typename T> static T *Attach(T *&slot, int key, size_t size, bool ro, std::vector<void *> &all)
+{
+    if (!slot && (slot = static_cast<T *>(AttachSegment(key, size, ro))))
+        all.push_back(slot);
+    return slot;
+}
+
 const PlayerStatusShm *Harness::PlayerSegment()
 {
-    if (!playerRo) {
-        playerRo = static_cast<PlayerStatusShm *>(
-            AttachSegment(PlayerKey(), TARN_SHM_PLAYER_SIZE, true));
-        if (playerRo)
-            attachments.push_back(playerRo);
-    }
-    return playerRo;
+    return Attach(playerRo, PlayerKey(), TARN_SHM_PLAYER_SIZE, true, attachments);
 }
 
 const PublishedStatusShm *Harness::PublishedSegment()
 {
-    if (!publishedRo) {
-        publishedRo = static_cast<PublishedStatusShm *>(
-            AttachSegment(PublishedKey(), TARN_SHM_PUBLISHED_SIZE, true));
-        if (publishedRo)
-            attachments.push_back(publishedRo);
-    }
-    return publishedRo;
+    return Attach(publishedRo, PublishedKey(), TARN_SHM_PUBLISHED_SIZE, true, attachments);
 }
 
 PlayerStatusShm *Harness::PlayerSegmentWritable()
 {
-    if (!playerRw) {
-        playerRw = static_cast<PlayerStatusShm *>(
-            AttachSegment(PlayerKey(), TARN_SHM_PLAYER_SIZE, false));
-        if (playerRw)
-            attachments.push_back(playerRw);
-    }
-    return playerRw;
+    return Attach(playerRw, PlayerKey(), TARN_SHM_PLAYER_SIZE, false, attachments);
 }
 
 void Harness::DetachSegments()

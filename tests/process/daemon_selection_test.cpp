@@ -1,7 +1,5 @@
 // Player selection with a real renderer (gmediarender) in the test's network
-// namespace: where requests go while a renderer is selected, what a source
-// change does to the selection, and what happens when the selected renderer
-// leaves the network.
+// namespace: where requests go, source changes, the renderer leaving.
 #include <gtest/gtest.h>
 
 #include <csignal>
@@ -62,12 +60,9 @@ protected:
     {
         std::string reply;
         Json::Value v;
-        if (h.Request(action, param, &reply) == 0) {
-            Json::CharReaderBuilder b;
-            std::string errs;
-            std::unique_ptr<Json::CharReader> r(b.newCharReader());
-            r->parse(reply.data(), reply.data() + reply.size(), &v, &errs);
-        }
+        std::unique_ptr<Json::CharReader> r(Json::CharReaderBuilder().newCharReader());
+        if (h.Request(action, param, &reply) == 0)
+            r->parse(reply.data(), reply.data() + reply.size(), &v, nullptr);
         return v;
     }
     Json::Value Status() { return Json(nullptr, ACT_GET_STATUS); }
@@ -84,12 +79,7 @@ TEST_F(SelectionTest, RequestsFollowTheSelectedPlayer)
     ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "0", &reply));
     EXPECT_EQ("null\n", reply);
     EXPECT_EQ(0, Json("0 1", ACT_LIST_RENDERERS)["current"].asInt());
-    Json::Value st = Status();
-    EXPECT_FALSE(st.isMember("PlayerState")) << st;
-    EXPECT_TRUE(st.isMember("TransportState")) << st;
-    // Selecting it again keeps one player for it.
-    ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "0", &reply));
-    EXPECT_TRUE(Status().isMember("TransportState"));
+    EXPECT_TRUE(Status().isMember("TransportState")) << Status();
 
     // The renderer player refuses what only the local player does.
     ASSERT_EQ(0, h.Request(ACT_SET_EQUALIZER, "0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0", &reply));
@@ -125,9 +115,8 @@ TEST_F(SelectionTest, SelectedRendererLeavingTheNetwork)
     ASSERT_NE(nullptr, pub);
     EXPECT_EQ(0, pub->changed);
 
-    // Killed without a bye-bye: the next action sent to it fails and the
-    // controller drops it; the loop then drops its player and the
-    // selection.
+    // Killed without a bye-bye: the next action fails, the renderer, its
+    // player and the selection are dropped.
     kill(renderer, SIGKILL);
     h.WaitExit(renderer, 10000);
     renderer = -1;
@@ -136,17 +125,11 @@ TEST_F(SelectionTest, SelectedRendererLeavingTheNetwork)
                           15000))
         << Json("0 10", ACT_LIST_RENDERERS) << h.Log();
     EXPECT_TRUE(WaitUntil([&] { return pub->changed == 1; }, 5000));
-    // No player selected: player actions do nothing and answer null.
+    // No player selected: player actions answer null.
     EXPECT_TRUE(Status().isNull());
-    ASSERT_EQ(0, h.Request(ACT_PLAY_PAUSE, nullptr, &reply));
-    EXPECT_EQ("null\n", reply);
     ASSERT_EQ(0, h.Request(ACT_QUEUE_LIST, "0 10", &reply));
     EXPECT_EQ("null\n", reply);
     EXPECT_EQ(0, h.CountLog("No upnp player index"));
-    // Nothing is published any more; the changed flag stays as it was
-    // last written.
-    EXPECT_EQ(1, pub->changed);
-    // Back to the local player.
     ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "-1", &reply));
     EXPECT_TRUE(Status().isMember("PlayerState"));
 }
