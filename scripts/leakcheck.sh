@@ -20,10 +20,11 @@ case "$B" in /*) ;; *) B="$SRC/$B" ;; esac
 
 if [ "$1" != "--inside" ]; then
     echo "leakcheck: building the sanitized daemon and its tools into $B (a few minutes the first time)"
+    mkdir -p "$B"
     cmake -S . -B "$B" -DTARN_SANITIZE=ON -DTARN_TESTS=OFF -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-        > "$B.cmake.log" 2>&1 || { cat "$B.cmake.log"; echo "leakcheck: cmake failed"; exit 1; }
+        > "$B/leakcheck-cmake.log" 2>&1 || { cat "$B/leakcheck-cmake.log"; echo "leakcheck: cmake failed"; exit 1; }
     cmake --build "$B" --target tarnaudiod tarnctl tarnlib mplayer-daemon -j"${TARN_JOBS:-2}" \
-        > "$B.build.log" 2>&1 || { tail -30 "$B.build.log"; echo "leakcheck: build failed"; exit 1; }
+        > "$B/leakcheck-build.log" 2>&1 || { tail -30 "$B/leakcheck-build.log"; echo "leakcheck: build failed"; exit 1; }
     exec "$SRC/scripts/netns-run" "$SRC/scripts/leakcheck.sh" --inside "$B"
 fi
 B=$2
