@@ -1,8 +1,6 @@
-// Generated tagged songs for the media library tests and benchmark.
-//
-// One short tone per format is encoded with the real encoders (sox, lame,
-// flac, oggenc) into a cache folder; every song is a copy of that template,
-// tagged with TagLib. Header only: included by tests and bench/scan.cpp.
+// Tagged songs for the media library tests and benchmark: one short tone per
+// format encoded once (sox, lame, flac, oggenc) into a cache folder, copied
+// and tagged with TagLib.
 #ifndef TARN_TEST_MEDIALIB_SONGS_H
 #define TARN_TEST_MEDIALIB_SONGS_H
 
@@ -23,8 +21,7 @@ struct Tags {
     int year = 0, track = 0;
 };
 
-// Encodes the template of one format ("mp3", "flac", "ogg", "wav") into
-// cacheDir once. Returns its path, or "" when an encoder failed.
+// The template of one format ("mp3", "flac", "ogg", "wav"); "" on failure.
 inline std::string TemplateSong(const std::string &cacheDir, const std::string &ext)
 {
     std::string out = cacheDir + "/template." + ext;
