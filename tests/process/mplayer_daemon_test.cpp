@@ -1,200 +1,256 @@
 // The real mplayer-daemon against a test-side command socket and player
-// status segment: songs of several formats played into one WAV file, the
-// commands while a song plays, the ways the process ends.
-#include "tests/process/mplayer_process_util.h"
-
+// status segment: songs of several formats played into one WAV file, garbage
+// on the command stream, the ways the process ends, and an internet radio
+// stream from a small ICY server on 127.0.0.1 with changing stream titles.
 #include <gtest/gtest.h>
 
-#include <chrono>
-#include <string>
+#include <poll.h>
+#include <signal.h>
+#include <sys/shm.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
-using namespace mptest;
+#include <atomic>
+#include <chrono>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include <httplib.h>
+
+#include "daemon/tarn_types.h"
+#include "platform/tarn_env.h"
+#include "tests/harness/harness.h"
+#include "tests/process/localplay_wav.h"
+#include "tools/mplayer-daemon/command_parser.h"
 
 namespace {
+
+bool WaitFor(const std::function<bool()> &cond, int timeoutMs)
+{
+    auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+    for (;;) {
+        if (cond())
+            return true;
+        if (std::chrono::steady_clock::now() >= end)
+            return false;
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+}
+void SleepMs(int ms) { std::this_thread::sleep_for(std::chrono::milliseconds(ms)); }
+
+// A sine tone file; the format follows the extension (mp3 through lame, m4a
+// through GStreamer, the rest through sox).
+bool MakeTone(const std::string &path, int freq, int seconds, int rate = 44100, int channels = 2)
+{
+    std::string q = "'" + path + "'", ext = path.substr(path.rfind('.') + 1);
+    std::string sox = "sox -n -r " + std::to_string(rate) + " -c " + std::to_string(channels) +
+                      " -b 16 %s synth " + std::to_string(seconds) + " sine " +
+                      std::to_string(freq) + " vol 0.5";
+    std::string cmd;
+    if (ext == "mp3")
+        cmd = "sox -n -r 44100 -c 2 -b 16 -t wav - synth " + std::to_string(seconds) + " sine " +
+              std::to_string(freq) + " vol 0.5 | lame --quiet -b 128 -t - " + q;
+    else if (ext == "m4a")
+        cmd = "gst-launch-1.0 -q audiotestsrc num-buffers=" + std::to_string(seconds * rate / 1024) +
+              " samplesperbuffer=1024 freq=" + std::to_string(freq) + " volume=0.5 ! audio/x-raw,rate=" +
+              std::to_string(rate) + " ! audioconvert ! avenc_aac ! mp4mux ! filesink location=" + q;
+    else
+        cmd = sox.replace(sox.find("%s"), 2, q);
+    return system((cmd + " >/dev/null 2>&1").c_str()) == 0;
+}
+
+std::string Padded(const std::string &text)
+{
+    std::string b(2048, '\0');
+    return b.replace(0, text.size(), text);
+}
+std::string Load(const std::string &uri) { return "loadfile \"" + MplayerEscapeUri(uri) + "\""; }
+std::string Text(const volatile char *p, size_t n)
+{
+    std::string s;
+    for (size_t i = 0; i < n && p[i]; ++i)
+        s += p[i];
+    return s;
+}
+
+// An ICY stream on loopback: an mp3 looped at 128 kbit/s (after a 2 s
+// burst), with a metadata block after every kMetaInt bytes when asked for,
+// its stream title changing after 5 s.
+class IcyServer {
+public:
+    static const int kMetaInt = 8000;
+    ~IcyServer() { Stop(); }
+    bool Start(const std::string &mp3, const std::vector<std::string> &titles)
+    {
+        server_.Get("/stream", [this, mp3, titles](const httplib::Request &req, httplib::Response &res) {
+            bool meta = req.get_header_value("Icy-MetaData") == "1";
+            askedForMeta_ = askedForMeta_ || meta;
+            res.set_header("icy-name", "Tarn Test Radio");
+            if (meta)
+                res.set_header("icy-metaint", std::to_string(kMetaInt));
+            auto start = std::chrono::steady_clock::now();
+            res.set_chunked_content_provider(
+                "audio/mpeg", [=, sent = size_t(0), pos = size_t(0)](size_t, httplib::DataSink &sink) mutable {
+                    std::string block;
+                    while (block.size() < size_t(kMetaInt)) {
+                        size_t n = std::min(kMetaInt - block.size(), mp3.size() - pos);
+                        block.append(mp3, pos, n);
+                        pos = (pos + n) % mp3.size();
+                    }
+                    if (meta) {  // sent with every block, changed or not, as many servers do
+                        size_t idx = std::min(titles.size() - 1, size_t(sent / 16000.0 / 5.0));
+                        std::string m = "StreamTitle='" + titles[idx] + "';";
+                        m.resize((m.size() + 15) / 16 * 16, '\0');
+                        block += char(m.size() / 16) + m;
+                    }
+                    sent += kMetaInt;
+                    auto due = start + std::chrono::milliseconds(long((double(sent) - 32000) / 16.0));
+                    while (!stop_ && std::chrono::steady_clock::now() < due)
+                        SleepMs(10);
+                    return !stop_ && sink.write(block.data(), block.size());
+                });
+        });
+        int port = server_.bind_to_any_port("127.0.0.1");
+        url_ = "http://127.0.0.1:" + std::to_string(port) + "/stream";
+        thread_ = std::thread([this] { server_.listen_after_bind(); });
+        return port > 0;
+    }
+    void Stop()
+    {
+        stop_ = true;
+        server_.stop();
+        if (thread_.joinable())
+            thread_.join();
+    }
+    std::string Url() const { return url_; }
+    bool AskedForMeta() const { return askedForMeta_; }
+
+private:
+    httplib::Server server_;
+    std::string url_;
+    std::thread thread_;
+    std::atomic<bool> stop_{false}, askedForMeta_{false};
+};
 
 class MplayerDaemonTest : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        static int salt = 0;
-        key_ = UniqueShmKey(++salt);
-        ASSERT_TRUE(seg_.Create(key_)) << "shmget: " << strerror(errno);
-        wav_ = root_.Path("/out.wav");
-        pidFile_ = root_.Path("/var/run/mplayer.daemon.pid");
+        ASSERT_TRUE(tarntest::InPrivateNetns()) << "run under scripts/netns-run";
+        shmId_ = shmget(TarnShmKeyPlayer(), sizeof(PlayerStatusShm), IPC_CREAT | 0666);
+        ASSERT_GE(shmId_, 0) << strerror(errno);
+        void *p = shmat(shmId_, nullptr, 0);
+        ASSERT_NE(p, (void *)-1);
+        memset(p, 0, sizeof(PlayerStatusShm));
+        seg_ = static_cast<volatile PlayerStatusShm *>(p);
+        wav_ = h_.Path("/out.wav");
+        setenv("TARN_AUDIO_OUT", ("wav:" + wav_).c_str(), 1);
+        for (const char *proxy : {"http_proxy", "HTTP_PROXY", "all_proxy", "ALL_PROXY"})
+            unsetenv(proxy);  // nothing between the player and the loopback server
+        ASSERT_EQ(0, h_.Run({"/bin/mkdir", "-p", h_.Path("/media")}));
+        listen_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_un addr = {};
+        addr.sun_family = AF_UNIX;
+        snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", h_.Path(TARN_MPLAYER_SOCKET).c_str());
+        ASSERT_EQ(0, bind(listen_, (sockaddr *)&addr, sizeof(addr)));
+        ASSERT_EQ(0, listen(listen_, 1));
     }
+    void TearDown() override
+    {
+        for (int fd : {conn_, listen_})
+            if (fd >= 0)
+                close(fd);
+        shmdt(const_cast<PlayerStatusShm *>(seg_));
+    }
+    std::string Media(const std::string &name) { return h_.Path("/media/") + name; }
 
-    std::string Media(const std::string &name) const { return root_.Path("/media/" + name); }
-
-    void Listen() { ASSERT_TRUE(sock_.Listen(root_.Path("/tmp/mplayer.sock"))); }
-
-    // Starts the player on uri with the WAV output and takes its connection.
+    // Starts the player the way the daemon does and takes its connection.
     void StartConnected(const std::string &uri, int volume = 100)
     {
-        Listen();
-        ASSERT_TRUE(player_.Start(root_, key_, "wav:" + wav_, uri, volume));
-        ASSERT_TRUE(sock_.Accept(10000)) << "mplayer-daemon did not connect";
+        pid_ = h_.Spawn({tarntest::BinPath("mplayer-daemon"), uri, "-loop", "0", "-daemon", "-volume",
+                         std::to_string(volume), "-af", "equalizer=0.0:0.0:0.0:0.0:0.0:0.0:0.0:0.0:0.0:0.0"});
+        ASSERT_GT(pid_, 0) << h_.Error();
+        pollfd p = {listen_, POLLIN, 0};
+        ASSERT_EQ(1, poll(&p, 1, 10000)) << "mplayer-daemon did not connect";
+        conn_ = accept4(listen_, nullptr, nullptr, SOCK_CLOEXEC);
+        ASSERT_GE(conn_, 0);
     }
-
-    // Waits until the segment reports uri playing with a known duration.
+    bool Send(const std::string &bytes)
+    {
+        return write(conn_, bytes.data(), bytes.size()) == ssize_t(bytes.size());
+    }
+    std::string Uri() { return Text(seg_->currentUri, sizeof(seg_->currentUri)); }
     void ExpectPlaying(const std::string &uri, int duration)
     {
-        EXPECT_TRUE(WaitFor([&] { return seg_.State() == PLAYER_STATE_PLAYING && seg_.Uri() == uri; },
-                            5000))
-            << "state " << seg_.State() << " uri [" << seg_.Uri() << "]";
-        EXPECT_TRUE(WaitFor([&] { return seg_.Duration() == duration; }, 5000))
-            << "duration " << seg_.Duration() << " for " << uri;
+        EXPECT_TRUE(WaitFor([&] { return seg_->state == PLAYER_STATE_PLAYING && Uri() == uri; }, 5000))
+            << "state " << seg_->state << " uri [" << Uri() << "]";
+        EXPECT_TRUE(WaitFor([&] { return seg_->duration == duration; }, 5000)) << uri;
     }
-
     // Waits for the end of the song and answers like the daemon (2 back).
     void ExpectEndAndAck(int timeoutMs)
     {
-        ASSERT_TRUE(WaitFor([&] { return seg_.State() == PLAYER_STATE_ENDED; }, timeoutMs))
-            << "state " << seg_.State() << " position " << seg_.Position();
-        seg_.SetState(PLAYER_STATE_PLAYING);
+        ASSERT_TRUE(WaitFor([&] { return seg_->state == PLAYER_STATE_ENDED; }, timeoutMs))
+            << "state " << seg_->state << " position " << seg_->position;
+        seg_->state = PLAYER_STATE_PLAYING;
     }
-
+    // Exit status 0, and the pid file removed.
     void ExpectCleanExit()
     {
-        EXPECT_EQ(player_.WaitExit(8000), 0);
-        EXPECT_NE(access(pidFile_.c_str(), F_OK), 0) << "pid file left behind";
+        EXPECT_EQ(0, h_.WaitExit(pid_, 8000));
+        EXPECT_FALSE(h_.Exists(TARN_MPLAYER_PID_FILE)) << "pid file left behind";
     }
 
-    TempRoot root_;
-    int key_ = 0;
-    PlayerSegment seg_;
-    CommandSocket sock_;
-    PlayerProcess player_;
+    tarntest::Harness h_;
+    int shmId_ = -1, listen_ = -1, conn_ = -1;
+    pid_t pid_ = -1;
+    volatile PlayerStatusShm *seg_ = nullptr;
     std::string wav_;
-    std::string pidFile_;
 };
 
 TEST_F(MplayerDaemonTest, PlaysEveryFormatBackToBackIntoOneWav)
 {
-    struct Song {
-        std::string file;
-        std::string uri;  // as handed to mplayer-daemon
-        double freq;
-        int seconds;
-        int rate;
-        int channels;
-    };
-    std::vector<Song> songs = {
+    struct Song { std::string file, uri; int freq, seconds, rate, channels; } songs[] = {
         {Media("tone a.mp3"), "", 440, 3, 44100, 2},
-        {Media("tone\\b.flac"), "", 660, 2, 48000, 1},  // a backslash in the name
+        {Media("tone\\b.flac"), "", 660, 2, 48000, 1},
         {Media("tone \"c\".ogg"), "", 880, 2, 22050, 2},
         {Media("tone-d.m4a"), "", 550, 2, 44100, 2},
     };
-    songs[0].uri = songs[0].file;
-    songs[1].uri = songs[1].file;
-    songs[2].uri = songs[2].file;
-    songs[3].uri = "file://" + songs[3].file;
-    for (const Song &s : songs)
+    for (Song &s : songs) {
+        s.uri = (s.file.find(".m4a") != std::string::npos ? "file://" : "") + s.file;
         ASSERT_TRUE(MakeTone(s.file, s.freq, s.seconds, s.rate, s.channels)) << s.file;
-
+    }
     StartConnected(songs[0].uri);
-    EXPECT_EQ(ReadFile(pidFile_), std::to_string(player_.Pid()) + "\n");
-    for (size_t i = 0; i < songs.size(); ++i) {
-        if (i > 0) {
-            ASSERT_TRUE(sock_.Load(songs[i].uri));
-        }
+    EXPECT_EQ(std::to_string(pid_) + "\n", h_.ReadFile(TARN_MPLAYER_PID_FILE));
+    for (size_t i = 0; i < 4; ++i) {
+        ASSERT_TRUE(i == 0 || Send(Load(songs[i].uri)));
         ExpectPlaying(songs[i].uri, songs[i].seconds);
-        if (i == 0) {
-            // The position moves with the playing time.
-            EXPECT_TRUE(WaitFor([&] { return seg_.Position() >= 1; }, 3000));
-            EXPECT_TRUE(WaitFor([&] { return seg_.Position() >= 2; }, 3000));
-        }
+        EXPECT_TRUE(i > 0 || (WaitFor([&] { return seg_->position >= 1; }, 3000) &&
+                              WaitFor([&] { return seg_->position >= 2; }, 3000)))
+            << "the position moves with the playing time";
         ExpectEndAndAck(songs[i].seconds * 1000 + 5000);
-        EXPECT_EQ(seg_.Position(), songs[i].seconds);
+        EXPECT_EQ(songs[i].seconds, seg_->position);
     }
-    // After the last song it waits for the next loadfile.
-    SleepMs(300);
-    EXPECT_TRUE(player_.Alive());
-    ASSERT_TRUE(sock_.Raw("quit"));
+    EXPECT_EQ(-1, h_.WaitExit(pid_, 300));  // after the last song it waits for a loadfile
+    ASSERT_TRUE(Send("quit"));
     ExpectCleanExit();
 
-    Wav w = ReadWav(wav_);
-    ASSERT_TRUE(w.ok) << w.why;
-    EXPECT_EQ(w.rate, 44100);
-    EXPECT_EQ(w.channels, 2);
-    EXPECT_NEAR(w.Seconds(), 9.0, 0.3);
-    double start = 0;
-    for (const Song &s : songs) {
-        EXPECT_NEAR(w.Frequency(start + 0.4, start + s.seconds - 0.4), s.freq, s.freq * 0.01)
-            << s.file;
-        EXPECT_GT(w.Rms(start + 0.4, start + s.seconds - 0.4), 0.2) << s.file;
-        start += s.seconds;
+    localplay::Wav w;
+    ASSERT_TRUE(localplay::LoadWav(wav_, &w));
+    EXPECT_TRUE(w.sizesFinal);
+    EXPECT_EQ(44100, w.rate);
+    EXPECT_EQ(2, w.channels);
+    EXPECT_NEAR(9.0, w.Seconds(), 0.3);
+    std::vector<localplay::Run> runs = localplay::ToneRuns(w, {440, 660, 880, 550});
+    ASSERT_EQ(4u, runs.size());
+    for (int i = 0; i < 4; ++i) {
+        EXPECT_EQ(i, runs[i].tone);
+        EXPECT_NEAR(songs[i].seconds, runs[i].length, 0.2) << songs[i].file;
+        EXPECT_GT(runs[i].rms, 0.2 * 32768) << songs[i].file;
     }
-}
-
-TEST_F(MplayerDaemonTest, PauseSeekVolumeMuteAndEqualizerWhilePlaying)
-{
-    // 3 s at 440 Hz, then 9 s at 880 Hz.
-    std::string a = Media("a.wav"), b = Media("b.wav"), song = Media("song.flac");
-    ASSERT_TRUE(MakeTone(a, 440, 3) && MakeTone(b, 880, 9) && Concat({a, b}, song));
-    StartConnected(song);
-    ExpectPlaying(song, 12);
-    EXPECT_EQ(seg_.Volume(), 100);
-    ASSERT_TRUE(WaitFor([&] { return seg_.Position() >= 1; }, 3000));
-
-    // Relative seek by 3 s: from about 1 s into the 880 Hz part.
-    int before = seg_.Position();
-    double mSeek = WavSecondsNow(wav_);
-    ASSERT_TRUE(sock_.Padded("seek 3"));
-    EXPECT_TRUE(WaitFor([&] { return seg_.Position() >= before + 3; }, 2000))
-        << "position " << seg_.Position() << " after seek from " << before;
-    EXPECT_LE(seg_.Position(), before + 5);
-
-    // Pause holds the position and the output; pause again resumes.
-    SleepMs(500);
-    ASSERT_TRUE(sock_.Raw("pause"));
-    ASSERT_TRUE(WaitFor([&] { return seg_.State() == PLAYER_STATE_PAUSED; }, 1000));
-    SleepMs(300);
-    int pausedAt = seg_.Position();
-    double wavPaused = WavSecondsNow(wav_);
-    SleepMs(1000);
-    EXPECT_EQ(seg_.Position(), pausedAt);
-    EXPECT_LT(WavSecondsNow(wav_) - wavPaused, 0.05);
-    ASSERT_TRUE(sock_.Raw("pause"));
-    EXPECT_TRUE(WaitFor([&] { return seg_.State() == PLAYER_STATE_PLAYING; }, 1000));
-    SleepMs(600);
-
-    // Volume, mute on and off, equalizer down and flat again.
-    double m1 = WavSecondsNow(wav_);
-    ASSERT_TRUE(sock_.Padded("setvol 50"));
-    SleepMs(900);
-    double m2 = WavSecondsNow(wav_);
-    ASSERT_TRUE(sock_.Padded("mute"));
-    SleepMs(700);
-    double m3 = WavSecondsNow(wav_);
-    ASSERT_TRUE(sock_.Padded("mute"));
-    SleepMs(700);
-    double m4 = WavSecondsNow(wav_);
-    ASSERT_TRUE(sock_.Padded("setequ -24.0 -24.0 -24.0 -24.0 -24.0 -24.0 -24.0 -24.0 -24.0 -24.0"));
-    SleepMs(700);
-    double m5 = WavSecondsNow(wav_);
-    ASSERT_TRUE(sock_.Padded("setequ 0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0"));
-    SleepMs(700);
-    double m6 = WavSecondsNow(wav_);
-    EXPECT_EQ(seg_.Volume(), 50);
-
-    ExpectEndAndAck(10000);
-    ASSERT_TRUE(sock_.Raw("quit"));
-    ExpectCleanExit();
-
-    Wav w = ReadWav(wav_);
-    ASSERT_TRUE(w.ok) << w.why;
-    // 12 s of song less the 3 s skipped.
-    EXPECT_NEAR(w.Seconds(), 9.0, 0.4);
-    EXPECT_NEAR(w.Frequency(0.2, mSeek - 0.1), 440, 5);
-    EXPECT_NEAR(w.Frequency(mSeek + 0.4, m1), 880, 9);
-    const double settle = 0.2;  // the output's latency behind a command
-    double full = w.Rms(m1 - 0.4, m1);
-    ASSERT_GT(full, 0.2);
-    EXPECT_NEAR(w.Rms(m1 + settle, m2) / full, 0.5, 0.05) << "setvol 50";
-    EXPECT_LT(w.Rms(m2 + settle, m3), 0.001) << "mute";
-    EXPECT_NEAR(w.Rms(m3 + settle, m4) / full, 0.5, 0.05) << "mute toggled off";
-    EXPECT_LT(w.Rms(m4 + settle, m5) / full, 0.1) << "equalizer at -24 dB";
-    EXPECT_NEAR(w.Rms(m5 + settle, m6) / full, 0.5, 0.05) << "equalizer flat";
 }
 
 TEST_F(MplayerDaemonTest, GarbageOnTheCommandStreamIsSkipped)
@@ -203,143 +259,101 @@ TEST_F(MplayerDaemonTest, GarbageOnTheCommandStreamIsSkipped)
     ASSERT_TRUE(MakeTone(song, 440, 8));
     StartConnected(song);
     ExpectPlaying(song, 8);
-    ASSERT_TRUE(sock_.SendBytes(std::string("\x01\x02junk 99 \xff\xfe", 13)));
-    ASSERT_TRUE(sock_.Padded("setvol 30"));
-    ASSERT_TRUE(sock_.SendBytes("more junk!"));
-    ASSERT_TRUE(sock_.Raw("pause"));
-    EXPECT_TRUE(WaitFor([&] { return seg_.State() == PLAYER_STATE_PAUSED && seg_.Volume() == 30; },
-                        2000))
-        << "state " << seg_.State() << " volume " << seg_.Volume();
-    ASSERT_TRUE(sock_.Raw("quit"));
+    ASSERT_TRUE(Send(std::string("\x01\x02junk 99 \xff\xfe", 13) + Padded("setvol 30") +
+                     "more junk!" + "pause"));
+    EXPECT_TRUE(WaitFor([&] { return seg_->state == PLAYER_STATE_PAUSED && seg_->value4104 == 30; }, 2000))
+        << "state " << seg_->state << " volume " << seg_->value4104;
+    ASSERT_TRUE(Send("quit"));
     ExpectCleanExit();
-    EXPECT_NE(ReadFile(root_.Path("/log.txt")).find("not a command"), std::string::npos);
+    EXPECT_NE(std::string::npos, h_.Log().find("not a command")) << h_.Log();
 }
 
-TEST_F(MplayerDaemonTest, SigtermCompletesTheWavFile)
+// SIGTERM and a closed connection both end the player cleanly, with a WAV
+// file whose sizes are final.
+TEST_F(MplayerDaemonTest, SigtermOrClosedConnectionCompletesTheWavFile)
 {
     std::string song = Media("s.mp3");
     ASSERT_TRUE(MakeTone(song, 440, 10));
-    StartConnected(song);
-    ASSERT_TRUE(WaitFor([&] { return seg_.Position() >= 1; }, 5000));
-    SleepMs(500);
-    player_.Signal(SIGTERM);
-    ExpectCleanExit();
-    Wav w = ReadWav(wav_);
-    ASSERT_TRUE(w.ok) << w.why;
-    EXPECT_GT(w.Seconds(), 1.2);
-    EXPECT_LT(w.Seconds(), 4.0);
-    EXPECT_NEAR(w.Frequency(0.2, 1.2), 440, 5);
-}
-
-TEST_F(MplayerDaemonTest, SigtermDuringStartUpLeavesNoPidFile)
-{
-    std::string song = Media("s.flac");
-    ASSERT_TRUE(MakeTone(song, 440, 5));
-    Listen();
-    // As soon as the pid file names it, the daemon may stop it.
-    for (int i = 0; i < 5; ++i) {
-        SCOPED_TRACE(i);
-        PlayerProcess p;
-        ASSERT_TRUE(p.Start(root_, key_, "wav:" + wav_, song));
-        ASSERT_TRUE(WaitFor([&] { return access(pidFile_.c_str(), F_OK) == 0; }, 5000));
-        p.Signal(SIGTERM);
-        EXPECT_EQ(p.WaitExit(8000), 0);
-        EXPECT_NE(access(pidFile_.c_str(), F_OK), 0) << "pid file left behind";
-        unlink(pidFile_.c_str());
-    }
-}
-
-// Without HOME the GStreamer registry is kept under the run root.
-TEST_F(MplayerDaemonTest, StartsWithoutHome)
-{
-    std::string song = Media("s.flac");
-    ASSERT_TRUE(MakeTone(song, 440, 1));
-    Listen();
-    player_.unsetVars = {"HOME", "GST_REGISTRY", "XDG_CACHE_HOME"};
-    ASSERT_TRUE(player_.Start(root_, key_, "wav:" + wav_, song));
-    ASSERT_TRUE(sock_.Accept(10000));
-    ExpectEndAndAck(10000);
-    EXPECT_EQ(access(root_.Path("/var/cache/mplayer-daemon/gst-registry.bin").c_str(), F_OK), 0);
-    ASSERT_TRUE(sock_.Raw("quit"));
-    ExpectCleanExit();
-}
-
-TEST_F(MplayerDaemonTest, ClosedConnectionEndsTheProcess)
-{
-    std::string song = Media("s.flac");
-    ASSERT_TRUE(MakeTone(song, 440, 10));
-    StartConnected(song);
-    ExpectPlaying(song, 10);
-    sock_.CloseClient();
-    ExpectCleanExit();
-    Wav w = ReadWav(wav_);
-    EXPECT_TRUE(w.ok) << w.why;
-}
-
-TEST_F(MplayerDaemonTest, ConnectsWhenTheSocketAppearsLate)
-{
-    std::string song = Media("s.wav");
-    ASSERT_TRUE(MakeTone(song, 440, 6));
-    ASSERT_TRUE(player_.Start(root_, key_, "wav:" + wav_, song));
-    // Plays and reports before anyone listens.
-    ExpectPlaying(song, 6);
-    ASSERT_TRUE(WaitFor([&] { return seg_.Position() >= 1; }, 3000));
-    Listen();
-    ASSERT_TRUE(sock_.Accept(6000)) << "no connection after the socket appeared";
-    ASSERT_TRUE(sock_.Raw("quit"));
-    ExpectCleanExit();
-}
-
-// Without a WAV file: "null" and "default" (this machine has no sound card:
-// the default output falls back to a null output) still play in real time.
-TEST_F(MplayerDaemonTest, PlaysInRealTimeWithoutDaemonOnOtherOutputs)
-{
-    std::string song = Media("s.ogg");
-    ASSERT_TRUE(MakeTone(song, 440, 2));
-    for (const char *out : {"null", "default"}) {
-        SCOPED_TRACE(out);
-        PlayerProcess p;
-        seg_.SetState(0);
-        auto t0 = std::chrono::steady_clock::now();
-        ASSERT_TRUE(p.Start(root_, key_, out, song));
-        ASSERT_TRUE(WaitFor([&] { return seg_.State() == PLAYER_STATE_ENDED; }, 10000))
-            << "state " << seg_.State();
-        double took = std::chrono::duration<double>(std::chrono::steady_clock::now() - t0).count();
-        EXPECT_GT(took, 1.8) << "the song was not played in real time";
-        EXPECT_EQ(seg_.Position(), 2);
-        EXPECT_TRUE(p.Alive());
-        p.Signal(SIGTERM);
-        EXPECT_EQ(p.WaitExit(8000), 0);
+    for (bool bySignal : {true, false}) {
+        SCOPED_TRACE(bySignal ? "SIGTERM" : "closed connection");
+        memset(const_cast<PlayerStatusShm *>(seg_), 0, sizeof(PlayerStatusShm));
+        StartConnected(song);
+        ASSERT_TRUE(WaitFor([&] { return seg_->position >= 1; }, 5000));
+        SleepMs(500);
+        if (bySignal)
+            kill(pid_, SIGTERM);
+        close(conn_);
+        conn_ = -1;
+        ExpectCleanExit();
+        localplay::Wav w;
+        ASSERT_TRUE(localplay::LoadWav(wav_, &w));
+        EXPECT_TRUE(w.sizesFinal);
+        EXPECT_GT(w.Seconds(), 1.2);
+        EXPECT_LT(w.Seconds(), 4.0);
+        std::vector<localplay::Run> runs = localplay::ToneRuns(w, {440});
+        ASSERT_EQ(1u, runs.size());
     }
 }
 
 TEST_F(MplayerDaemonTest, UnplayableSongIsReportedAsEnded)
 {
     std::string bad = Media("bad.mp3"), good = Media("good.flac");
-    {
-        FILE *f = fopen(bad.c_str(), "wb");
-        ASSERT_TRUE(f);
-        for (int i = 0; i < 20000; ++i)
-            fputc((i * 7919) & 0xff, f);
-        fclose(f);
-    }
+    std::string noise(20000, '\0');
+    for (int i = 0; i < 20000; ++i)
+        noise[i] = char((i * 7919) & 0xff);
+    ASSERT_EQ(0, h_.WriteFile("/media/bad.mp3", noise));
     ASSERT_TRUE(MakeTone(good, 440, 2));
     StartConnected(bad);
     ExpectEndAndAck(8000);
-    EXPECT_EQ(seg_.Uri(), bad);
-    ASSERT_TRUE(sock_.Load(Media("missing.mp3")));
-    ExpectEndAndAck(8000);
-    ASSERT_TRUE(sock_.Load("http://127.0.0.1:1/station"));  // nobody listens there
-    ExpectEndAndAck(8000);
-    ASSERT_TRUE(sock_.Load(good));
+    EXPECT_EQ(bad, Uri());
+    for (std::string uri : {Media("missing.mp3"), std::string("http://127.0.0.1:1/station")}) {
+        ASSERT_TRUE(Send(Load(uri)));
+        ExpectEndAndAck(8000);
+    }
+    ASSERT_TRUE(Send(Load(good)));
     ExpectPlaying(good, 2);
     ExpectEndAndAck(8000);
-    ASSERT_TRUE(sock_.Raw("quit"));
+    ASSERT_TRUE(Send("quit"));
     ExpectCleanExit();
-    std::string log = ReadFile(root_.Path("/log.txt"));
-    EXPECT_NE(log.find("Failed to play [" + bad + "]"), std::string::npos) << log;
-    EXPECT_NE(log.find("missing.mp3"), std::string::npos) << log;
-    EXPECT_NE(log.find("127.0.0.1:1/station"), std::string::npos) << log;
+    std::string log = h_.Log();
+    EXPECT_NE(std::string::npos, log.find("Failed to play [" + bad + "]")) << log;
+    EXPECT_NE(std::string::npos, log.find("missing.mp3")) << log;
+    EXPECT_NE(std::string::npos, log.find("127.0.0.1:1/station")) << log;
+}
+
+TEST_F(MplayerDaemonTest, RadioStationNameAndChangingStreamTitle)
+{
+    std::string file = Media("tone.mp3");
+    ASSERT_TRUE(MakeTone(file, 440, 3));
+    IcyServer server;
+    const std::string second = "Second Song - Artist \xc3\xa9";
+    ASSERT_TRUE(server.Start(h_.ReadFile("/media/tone.mp3"), {"First Song", second}));
+    StartConnected(server.Url(), 80);
+    auto station = [&] { return Text(seg_->radioStation, sizeof(seg_->radioStation)); };
+    auto title = [&] { return Text(seg_->streamTitle, sizeof(seg_->streamTitle)); };
+    EXPECT_TRUE(WaitFor([&] { return Uri() == server.Url(); }, 2000)) << Uri();
+    EXPECT_TRUE(WaitFor([&] { return station() == "Tarn Test Radio"; }, 10000)) << station();
+    EXPECT_TRUE(WaitFor([&] { return title() == "First Song"; }, 10000)) << title();
+    EXPECT_TRUE(WaitFor([&] { return seg_->position >= 1; }, 5000));
+    EXPECT_EQ(PLAYER_STATE_PLAYING, seg_->state);
+    EXPECT_EQ(-1, seg_->duration);
+    EXPECT_TRUE(WaitFor([&] { return title() == second; }, 15000)) << title();
+    EXPECT_EQ("Tarn Test Radio", station());
+    EXPECT_TRUE(server.AskedForMeta());
+
+    // A seek on a live stream is refused without harm.
+    ASSERT_TRUE(Send(Padded("seek 30")));
+    SleepMs(500);
+    EXPECT_EQ(PLAYER_STATE_PLAYING, seg_->state);
+    ASSERT_TRUE(Send("quit"));
+    ExpectCleanExit();
+    server.Stop();
+    localplay::Wav w;
+    ASSERT_TRUE(localplay::LoadWav(wav_, &w));
+    EXPECT_GT(w.Seconds(), 5.0);
+    std::vector<localplay::Run> runs = localplay::ToneRuns(w, {440});
+    ASSERT_FALSE(runs.empty());
+    EXPECT_GT(runs[0].length, 2.0);
 }
 
 }  // namespace
