@@ -103,26 +103,39 @@ void Playlist::ShuffleOrder()
     orderIndex = 0;
 }
 
+namespace {
+
+// A private copy of a song record, with room made in both vectors so that
+// adding it cannot fail half-way. Null (logged) when memory runs out.
+TARN_MEDIA_INFO *NewEntry(const TARN_MEDIA_INFO *info, std::vector<TARN_MEDIA_INFO *> &entries,
+                          std::vector<int32_t> &order)
+{
+    TARN_MEDIA_INFO *copy = new (std::nothrow) TARN_MEDIA_INFO;
+    if (copy) {
+        memcpy(copy, info, sizeof(TARN_MEDIA_INFO));
+        try {
+            entries.reserve(entries.size() + 1);
+            order.reserve(entries.size() + 1);
+            return copy;
+        } catch (const std::bad_alloc &) {
+            delete copy;
+        }
+    }
+    TLOG("Failed to new TARN_MEDIA_INFO");
+    return nullptr;
+}
+
+}  // namespace
+
 int Playlist::AddSong(const TARN_MEDIA_INFO *info)
 {
     if (!info) {
         TLOG("Bad parameter");
         return -1;
     }
-    TARN_MEDIA_INFO *copy = new (std::nothrow) TARN_MEDIA_INFO;
-    if (!copy) {
-        TLOG("Failed to new TARN_MEDIA_INFO");
+    TARN_MEDIA_INFO *copy = NewEntry(info, entries, order);
+    if (!copy)
         return -1;
-    }
-    memcpy(copy, info, sizeof(TARN_MEDIA_INFO));
-    try {
-        entries.reserve(entries.size() + 1);
-        order.reserve(order.size() + 1);
-    } catch (const std::bad_alloc &) {
-        delete copy;
-        TLOG("Failed to new TARN_MEDIA_INFO");
-        return -1;
-    }
     entries.push_back(copy);
     order.push_back(static_cast<int32_t>(entries.size() - 1));
     ShuffleOrder();
@@ -166,20 +179,9 @@ int Playlist::InsertSong(unsigned index, const TARN_MEDIA_INFO *info)
         TLOG("Bad parameters");
         return -1;
     }
-    TARN_MEDIA_INFO *copy = new (std::nothrow) TARN_MEDIA_INFO;
-    if (!copy) {
-        TLOG("Failed to new TARN_MEDIA_INFO");
+    TARN_MEDIA_INFO *copy = NewEntry(info, entries, order);
+    if (!copy)
         return -1;
-    }
-    memcpy(copy, info, sizeof(TARN_MEDIA_INFO));
-    try {
-        entries.reserve(entries.size() + 1);
-        order.reserve(entries.size() + 1);
-    } catch (const std::bad_alloc &) {
-        delete copy;
-        TLOG("Failed to new TARN_MEDIA_INFO");
-        return -1;
-    }
     entries.insert(entries.begin() + index, copy);
     if (index < current)
         ++current;

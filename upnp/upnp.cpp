@@ -224,26 +224,29 @@ int UpnpController::FindServerByUdn(const std::string &udn)
 // List replies. The caller holds the lock (the request handler takes it
 // around these calls).
 
-int UpnpController::GetServerList(Json::Value &reply, int start, int limit)
+namespace {
+
+// One page of a device list: entries from start, at most limit of them (no
+// bound for 0), each filled by fill(record, item).
+template <typename Info, typename Fill>
+void ListPage(const std::vector<Info *> &records, int &start, int &limit, Json::Value &reply, Fill fill)
 {
     if (start < 0)
         start = 0;
     if (limit < 0)
         limit = 10;
     Json::Value list(Json::arrayValue);
-    for (size_t i = 0; i < servers.size(); ++i) {
+    for (size_t i = 0; i < records.size(); ++i) {
         int index = static_cast<int>(i);
-        if (index < start)
+        if (index < start || records[i] == nullptr)
             continue;
-        const SERVER_INFO *s = servers[i];
-        if (s == nullptr)
-            continue;
+        const Info *r = records[i];
         Json::Value item(Json::objectValue);
-        item["friendly_name"] = s->friendly_name;
-        item["udn"] = s->udn;
-        item["ip"] = s->ip;
-        item["port"] = s->port;
-        item["control_url"] = s->cds_control_url;
+        item["friendly_name"] = r->friendly_name;
+        item["udn"] = r->udn;
+        item["ip"] = r->ip;
+        item["port"] = r->port;
+        fill(*r, item);
         item["index"] = index;
         list.append(item);
         if (limit > 0 && index + 1 - start >= limit)
@@ -252,39 +255,25 @@ int UpnpController::GetServerList(Json::Value &reply, int start, int limit)
     reply["list"] = list;
     reply["start"] = start;
     reply["limit"] = limit;
+}
+
+}  // namespace
+
+int UpnpController::GetServerList(Json::Value &reply, int start, int limit)
+{
+    ListPage(servers, start, limit, reply, [](const SERVER_INFO &s, Json::Value &item) {
+        item["control_url"] = s.cds_control_url;
+    });
     reply["total"] = Json::UInt(servers.size());
     return 0;
 }
 
 int UpnpController::GetRendererList(Json::Value &reply, int start, int limit)
 {
-    if (start < 0)
-        start = 0;
-    if (limit < 0)
-        limit = 10;
-    Json::Value list(Json::arrayValue);
-    for (size_t i = 0; i < renderers.size(); ++i) {
-        int index = static_cast<int>(i);
-        if (index < start)
-            continue;
-        const RENDERER_INFO *r = renderers[i];
-        if (r == nullptr)
-            continue;
-        Json::Value item(Json::objectValue);
-        item["friendly_name"] = r->friendly_name;
-        item["udn"] = r->udn;
-        item["ip"] = r->ip;
-        item["port"] = r->port;
-        item["seek"] = r->can_seek;
-        item["set_volume"] = r->can_set_volume;
-        item["index"] = index;
-        list.append(item);
-        if (limit > 0 && index + 1 - start >= limit)
-            break;
-    }
-    reply["list"] = list;
-    reply["start"] = start;
-    reply["limit"] = limit;
+    ListPage(renderers, start, limit, reply, [](const RENDERER_INFO &r, Json::Value &item) {
+        item["seek"] = r.can_seek;
+        item["set_volume"] = r.can_set_volume;
+    });
     reply["current"] = Json::UInt(current.load());
     reply["total"] = Json::UInt(renderers.size());
     return 0;
