@@ -6,7 +6,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
-#include <dirent.h>
 #include <filesystem>
 #include <fstream>
 #include <fcntl.h>
@@ -15,7 +14,6 @@
 #include <sys/prctl.h>
 #include <sys/shm.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -51,10 +49,9 @@ void EmptyDir(const std::string &dir)
 
 void RemoveProcessRoot()
 {
-    if (g_processRoot.empty())
-        return;
-    EmptyDir(g_processRoot);
-    rmdir(g_processRoot.c_str());
+    std::error_code ec;
+    if (!g_processRoot.empty())
+        std::filesystem::remove_all(g_processRoot, ec);
 }
 
 int MakeDirs(const std::string &path)
@@ -108,23 +105,12 @@ std::string ReadUntilClosed(int fd, long end)
 
 bool InPrivateNetns()
 {
-    char self[128] = {0};
-    char init[128] = {0};
-    ssize_t a = readlink("/proc/self/ns/net", self, sizeof(self) - 1);
-    ssize_t b = readlink("/proc/1/ns/net", init, sizeof(init) - 1);
-    if (a > 0 && b > 0)
-        return strcmp(self, init) != 0;
+    std::error_code e1, e2;
+    auto self = std::filesystem::read_symlink("/proc/self/ns/net", e1);
+    auto init = std::filesystem::read_symlink("/proc/1/ns/net", e2);
+    if (!e1 && !e2)
+        return self != init;
     return TarnEnvGet("TARN_IN_NETNS") == "1";
-}
-
-std::string BinPath(const char *name)
-{
-    return std::string(TARN_BIN_DIR) + "/" + name;
-}
-
-std::string SourcePath(const char *relative)
-{
-    return std::string(TARN_SOURCE_DIR) + "/" + relative;
 }
 
 TARN_MEDIA_INFO MakeMediaInfo(const std::string &path, const std::string &title,
@@ -133,14 +119,7 @@ TARN_MEDIA_INFO MakeMediaInfo(const std::string &path, const std::string &title,
     TARN_MEDIA_INFO info;
     memset(&info, 0, sizeof(info));
     snprintf(info.path, sizeof(info.path), "%s", path.c_str());
-    std::string t = title;
-    if (t.empty()) {
-        size_t slash = path.rfind('/');
-        t = slash == std::string::npos ? path : path.substr(slash + 1);
-        size_t dot = t.rfind('.');
-        if (dot != std::string::npos && dot > 0)
-            t = t.substr(0, dot);
-    }
+    std::string t = title.empty() ? std::filesystem::path(path).stem().string() : title;
     snprintf(info.title, sizeof(info.title), "%s", t.c_str());
     snprintf(info.artist, sizeof(info.artist), "%s", artist.c_str());
     info.duration = duration;
@@ -159,18 +138,9 @@ ControlRequest MakeRequest(int action, const char *param)
 
 int CountFds(pid_t pid)
 {
-    char path[64];
-    snprintf(path, sizeof(path), "/proc/%d/fd", static_cast<int>(pid));
-    DIR *d = opendir(path);
-    if (!d)
-        return -1;
-    int n = 0;
-    while (struct dirent *e = readdir(d)) {
-        if (e->d_name[0] != '.')
-            ++n;
-    }
-    closedir(d);
-    return n;
+    std::error_code ec;
+    std::filesystem::directory_iterator it("/proc/" + std::to_string(pid) + "/fd", ec);
+    return ec ? -1 : static_cast<int>(std::distance(it, {}));
 }
 
 // ---------------------------------------------------------------------------
@@ -222,19 +192,13 @@ void Harness::PrepareRoot()
     if (root.empty())
         return;
     EmptyDir(root);
-    static const char *dirs[] = {"/tmp", "/var/run", "/etc", "/usr/tarn/bin", "/usr/tarn/etc/audio",
-                                 "/usr/tarn/etc.defaults/audio"};
-    for (const char *d : dirs)
+    for (const char *d : {"/tmp", "/var/run", "/etc", "/usr/tarn/bin", "/usr/tarn/etc/audio",
+                          "/usr/tarn/etc.defaults/audio"})
         MakeDirs(root + d);
     std::string mplayer = BinPath("mplayer-daemon");
     std::error_code ec;
     if (access(mplayer.c_str(), X_OK) == 0)
         std::filesystem::copy_file(mplayer, Path(TARN_MPLAYER_BIN), ec);
-}
-
-std::string Harness::Path(const char *fixedPath) const
-{
-    return root + fixedPath;
 }
 
 int Harness::WriteFile(const char *fixedPath, const std::string &content) const
@@ -255,21 +219,17 @@ std::string Harness::ReadFile(const char *fixedPath) const
 
 bool Harness::Exists(const char *fixedPath) const
 {
-    struct stat st;
-    return lstat(Path(fixedPath).c_str(), &st) == 0;
+    std::error_code ec;
+    return std::filesystem::exists(std::filesystem::symlink_status(Path(fixedPath), ec));
 }
 
 // ---- processes -------------------------------------------------------------
 
 void Harness::Reap()
 {
-    for (;;) {
-        int status = 0;
-        pid_t p = waitpid(-1, &status, WNOHANG);
-        if (p <= 0)
-            break;
+    int status = 0;
+    for (pid_t p; (p = waitpid(-1, &status, WNOHANG)) > 0;)
         reaped[p] = status;
-    }
 }
 
 int Harness::WaitExit(pid_t pid, int timeoutMs)
@@ -278,12 +238,8 @@ int Harness::WaitExit(pid_t pid, int timeoutMs)
     for (;;) {
         Reap();
         auto it = reaped.find(pid);
-        if (it != reaped.end()) {
-            int st = it->second;
-            if (WIFEXITED(st))
-                return WEXITSTATUS(st);
-            return -2;
-        }
+        if (it != reaped.end())
+            return WIFEXITED(it->second) ? WEXITSTATUS(it->second) : -2;
         if (NowMs() >= end)
             return -1;
         SleepMs(5);
@@ -366,11 +322,6 @@ int Harness::Run(const std::vector<std::string> &argv, std::string *out, int tim
     return rc == -2 ? -1 : rc;
 }
 
-int Harness::Launch(std::string *out, int timeoutMs)
-{
-    return Run({BinPath("tarnaudiod")}, out, timeoutMs);
-}
-
 int Harness::PidFromFile() const
 {
     return TLIBCReadPidFile(Path(TARN_PID_FILE).c_str());
@@ -380,10 +331,8 @@ int Harness::Start(int timeoutMs)
 {
     if (!error.empty() && error.find("TARN_ROOT") != std::string::npos)
         return -1;
-    if (daemonPid > 0) {
-        error = "daemon already started by this harness";
-        return -1;
-    }
+    if (daemonPid > 0)
+        return error = "daemon already started by this harness", -1;
     long end = NowMs() + timeoutMs;
     std::string out;
     int rc = Launch(&out, timeoutMs);
@@ -435,8 +384,7 @@ int Harness::Connect() const
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     if (fd < 0)
         return -1;
-    struct sockaddr_un addr;
-    memset(&addr, 0, sizeof(addr));
+    struct sockaddr_un addr = {};
     addr.sun_family = AF_UNIX;
     snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", Path(TARN_CTRL_SOCKET).c_str());
     if (connect(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) != 0) {
@@ -476,29 +424,11 @@ int Harness::SendBytes(const void *bytes, size_t length, std::string *reply, int
     return 0;
 }
 
-int Harness::RequestRaw(const ControlRequest &request, std::string *reply, int timeoutMs)
-{
-    return SendBytes(&request, sizeof(request), reply, timeoutMs);
-}
-
-int Harness::Request(int action, const char *param, std::string *reply, int timeoutMs)
-{
-    ControlRequest req = MakeRequest(action, param);
-    return RequestRaw(req, reply, timeoutMs);
-}
-
-int Harness::QueueAdd(const TARN_MEDIA_INFO &info)
-{
-    ControlRequest req = MakeRequest(ACT_QUEUE_ADD);
-    memcpy(req.parameter, &info, sizeof(info));
-    return RequestRaw(req, nullptr);
-}
-
 int Harness::QueueInsert(const TARN_MEDIA_INFO &info, int position)
 {
-    ControlRequest req = MakeRequest(ACT_QUEUE_INSERT);
+    ControlRequest req = MakeRequest(position < 0 ? ACT_QUEUE_ADD : ACT_QUEUE_INSERT);
     memcpy(req.parameter, &info, sizeof(info));
-    int32_t pos = position;
+    int32_t pos = position < 0 ? 0 : position;
     memcpy(reinterpret_cast<char *>(&req) + CTRL_INSERT_POS_OFFSET, &pos, sizeof(pos));
     return RequestRaw(req, nullptr);
 }
@@ -521,14 +451,10 @@ int Harness::CountLog(const std::string &needle) const
 
 bool Harness::WaitLog(const std::string &needle, int timeoutMs) const
 {
-    long end = NowMs() + timeoutMs;
-    for (;;) {
-        if (CountLog(needle) > 0)
-            return true;
+    for (long end = NowMs() + timeoutMs; CountLog(needle) == 0; SleepMs(10))
         if (NowMs() >= end)
             return false;
-        SleepMs(10);
-    }
+    return true;
 }
 
 void Harness::ClearLog() const
@@ -537,16 +463,6 @@ void Harness::ClearLog() const
 }
 
 // ---- segments ----------------------------------------------------------------
-
-int Harness::PlayerKey() const
-{
-    return TarnShmKeyPlayer();
-}
-
-int Harness::PublishedKey() const
-{
-    return TarnShmKeyPublished();
-}
 
 template <typename T> static T *Attach(T *&slot, int key, size_t size, bool ro, std::vector<void *> &all)
 {

@@ -17,13 +17,14 @@
 #include <vector>
 
 #include "daemon/tarn_types.h"
+#include "platform/tarn_env.h"
 
 namespace tarntest {
 
 // True outside the machine's own network namespace (or TARN_IN_NETNS=1).
 bool InPrivateNetns();
-std::string BinPath(const char *name);        // <build>/bin/<name>
-std::string SourcePath(const char *relative); // <source>/<relative>
+inline std::string BinPath(const char *name) { return std::string(TARN_BIN_DIR) + "/" + name; }
+inline std::string SourcePath(const char *rel) { return std::string(TARN_SOURCE_DIR) + "/" + rel; }
 // A song record; the title defaults to the file name without extension.
 TARN_MEDIA_INFO MakeMediaInfo(const std::string &path, const std::string &title = "",
                               const std::string &artist = "", float duration = 0.0f);
@@ -40,19 +41,20 @@ public:
     Harness(const Harness &) = delete;
     Harness &operator=(const Harness &) = delete;
 
-    // ---- files of the root --------------------------------------------
     const std::string &Root() const { return root; }
-    std::string Path(const char *fixedPath) const; // Root() + fixedPath
+    std::string Path(const char *fixedPath) const { return root + fixedPath; }
     int WriteFile(const char *fixedPath, const std::string &content) const;
     std::string ReadFile(const char *fixedPath) const;
     bool Exists(const char *fixedPath) const;
 
-    // ---- tarnaudiod -----------------------------------------------------
     // Starts tarnaudiod; 0 once its pid file names a live process that answers
     // ACT_GET_STATUS, else -1 with Error() set.
     int Start(int timeoutMs = 15000);
     // Runs tarnaudiod until the launching process ends: its exit status, output.
-    int Launch(std::string *out = nullptr, int timeoutMs = 15000);
+    int Launch(std::string *out = nullptr, int timeoutMs = 15000)
+    {
+        return Run({BinPath("tarnaudiod")}, out, timeoutMs);
+    }
     // SIGTERM, then its exit status; -1 when it had to be killed or never ran.
     int Stop(int timeoutMs = 15000);
     pid_t Pid() const { return daemonPid; }
@@ -68,27 +70,30 @@ public:
     int Run(const std::vector<std::string> &argv, std::string *out = nullptr,
             int timeoutMs = 30000);
 
-    // ---- control requests ----------------------------------------------
     // One write of 8196 bytes; 0 and the reply text up to its NUL, -1 when no
     // reply came. SendBytes writes any bytes and counts what came back.
     int Request(int action, const char *param = nullptr, std::string *reply = nullptr,
-                int timeoutMs = 3000);
-    int RequestRaw(const ControlRequest &request, std::string *reply, int timeoutMs = 3000);
+                int timeoutMs = 3000)
+    {
+        return RequestRaw(MakeRequest(action, param), reply, timeoutMs);
+    }
+    int RequestRaw(const ControlRequest &request, std::string *reply, int timeoutMs = 3000)
+    {
+        return SendBytes(&request, sizeof(request), reply, timeoutMs);
+    }
     int SendBytes(const void *bytes, size_t length, std::string *reply, int timeoutMs = 3000,
                   size_t *received = nullptr);
     int Connect() const;
-    int QueueAdd(const TARN_MEDIA_INFO &info);
-    int QueueInsert(const TARN_MEDIA_INFO &info, int position);
+    int QueueAdd(const TARN_MEDIA_INFO &info) { return QueueInsert(info, -1); }
+    int QueueInsert(const TARN_MEDIA_INFO &info, int position); // position < 0: add
 
-    // ---- log ---------------------------------------------------------------
     std::string Log() const;                       // TARN_LOG_FILE contents
     int CountLog(const std::string &needle) const; // occurrences
     bool WaitLog(const std::string &needle, int timeoutMs = 5000) const;
     void ClearLog() const;
 
-    // ---- segments ------------------------------------------------------
-    int PlayerKey() const;
-    int PublishedKey() const;
+    int PlayerKey() const { return TarnShmKeyPlayer(); }
+    int PublishedKey() const { return TarnShmKeyPublished(); }
     // Attachments stay until DetachSegments() or the destructor; null if absent.
     const PlayerStatusShm *PlayerSegment();
     const PublishedStatusShm *PublishedSegment();

@@ -1,6 +1,6 @@
 // Audio settings: the OSS mixer through a stand-in sound card (highest
-// numbered mixer first, PCM channel first), the saved volume, the playable
-// file types and equalizer profile lookup.
+// numbered mixer first, PCM channel first), the saved volume and equalizer
+// profile lookup.
 #include <gtest/gtest.h>
 
 #include <cerrno>
@@ -113,18 +113,6 @@ TEST(Mixer, HighestMixerAndPcmChannelFirst)
     EXPECT_EQ(12, VolumeConfGet());
     MixerSetOps(nullptr);
     g_mixers.clear();
-}
-
-TEST(AudioFiles, PlayableTypes)
-{
-    for (const char *p : {"/a.b/song.mp3", "S.FLAC", "x.m4b", ".ogg", "song.jpg.mp3", "a.ape"})
-        EXPECT_EQ(1, AudioIsSupportedFile(1, p)) << p;
-    for (const char *p : {"song.mp4", "song.mp3x", "song", "/music.mp3/song", "", "HTTP://radio/stream", (const char *)nullptr})
-        EXPECT_EQ(0, AudioIsSupportedFile(1, p)) << (p ? p : "null");
-    EXPECT_EQ(0, AudioIsSupportedFile(2, "song.flac")) << "the short list";
-    EXPECT_EQ(1, AudioIsSupportedFile(2, "Song.M4b"));
-    EXPECT_EQ(1, AudioIsSupportedFile(2, "https://radio.example/listen.pls"));
-    EXPECT_EQ(1, AudioIsSupportedFile(0, "song.txt"));
 }
 
 TEST(EqProfiles, PrefixMatchFirstLineWinsAndDefaultProfile)

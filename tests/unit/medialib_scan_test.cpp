@@ -76,7 +76,6 @@ TEST_F(LibraryTest, IncrementalRescanAndDamagedFilesAreSkipped)
     MediaSong s, after;
     ASSERT_EQ(1, lib.FindByPath(canon + "/a.mp3", &s));
     EXPECT_EQ("Alb", s.album);
-    EXPECT_EQ(22050, s.sampleRate);
     EXPECT_NEAR(0.3, s.duration, 0.1);
     ASSERT_EQ(1, lib.FindByPath(canon + "/c.ogg", &s));
     EXPECT_EQ("Calm \xC3\xA9t\xC3\xA9", s.title);
@@ -166,8 +165,7 @@ TEST_F(LibraryTest, RandomSelectionOfOneHundredDistinctSongs)
             ids.insert(s.id);
         }
         EXPECT_EQ(100u, ids.size());
-        if (round == 1)
-            EXPECT_NE(first, ids) << "a new selection every time";
+        EXPECT_TRUE(round == 0 || first != ids) << "a new selection every time";
         first = ids;
     }
 }

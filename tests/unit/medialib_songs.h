@@ -35,16 +35,12 @@ inline std::string TemplateSong(const std::string &cacheDir, const std::string &
         if (system(cmd.c_str()) != 0)
             return "";
     }
-    std::string cmd;
-    if (ext == "mp3")
-        cmd = "lame --quiet -b 32 --id3v2-only --tt x '" + wav + "' '" + out + "'";
-    else if (ext == "flac")
-        cmd = "flac -s -f '" + wav + "' -o '" + out + "'";
-    else if (ext == "ogg")
-        cmd = "oggenc -Q '" + wav + "' -o '" + out + "'";
-    else if (ext == "wav")
-        cmd = "cp '" + wav + "' '" + out + "'";
-    else
+    std::string in = "'" + wav + "' ", to = "'" + out + "'";
+    std::string cmd = ext == "mp3"  ? "lame --quiet -b 32 --id3v2-only --tt x " + in + to
+                      : ext == "flac" ? "flac -s -f " + in + "-o " + to
+                      : ext == "ogg"  ? "oggenc -Q " + in + "-o " + to
+                      : ext == "wav"  ? "cp " + in + to : "";
+    if (cmd.empty())
         return "";
     if (system((cmd + " >/dev/null 2>&1").c_str()) != 0)
         return "";
