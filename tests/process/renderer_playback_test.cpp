@@ -1,17 +1,13 @@
 // The daemon driving a real UPnP renderer (gmediarender into a fakesink) in
-// the test's private network, songs fetched from the song server: one flow
-// through queue, play, pause/resume/seek, volume, mute, the status reply, the
-// published segment, "Repeat One" and the loss of the renderer.
+// the test's network, songs fetched from the song server, in one flow.
 #include <gtest/gtest.h>
 
 #include <chrono>
 #include <functional>
 #include <json/json.h>
-#include <thread>
 
 #include "platform/media_id.h"
 #include "tests/process/tarnweb_test_util.h"
-#include "tests/tools/fakedevice/fake_device.h"
 
 namespace {
 
@@ -76,8 +72,7 @@ TEST(RendererPlayback, QueueTransportVolumeStatusRepeatOneAndLossOfTheRenderer)
     f.songs = tarnwebtest::MakeLibrary(f.h, "/music", kSongSeconds, &error);
     ASSERT_EQ(3u, f.songs.size()) << error;  // mp3, flac, ogg
     f.h.WriteFile("/etc/tarninfo.conf", "admin_port=18080\nnet_card1_ifname=tveth0\n");
-    f.web = tarnwebtest::StartSongServer(f.h, {"--access-log", f.h.Path("/tmp/tarnweb-access.log")},
-                                         "10.77.0.1", 18080);
+    f.web = tarnwebtest::StartSongServer(f.h, {"--access-log", f.h.Path("/tmp/tarnweb-access.log")});
     ASSERT_GT(f.web, 0) << "tarnweb did not start";
     ASSERT_EQ(0, f.h.Start()) << f.h.Error();
     // The renderer starts after the daemon, on the veth end that the daemon's
@@ -126,23 +121,19 @@ TEST(RendererPlayback, QueueTransportVolumeStatusRepeatOneAndLossOfTheRenderer)
     EXPECT_NEAR(kSongSeconds, seg->duration, 1);
     EXPECT_EQ(1, seg->repeatMode);
 
-    // The renderer announces only changes: start from a known volume. Steps
-    // start from the volume it last reported.
-    f.Ask(ACT_SET_VOLUME, "50");
-    WAIT(v["Volume"] == "50", 5000);
-    f.Ask(ACT_SET_VOLUME, "150");  // clamped
-    WAIT(v["Volume"] == "100", 5000);
-    f.Ask(ACT_SET_VOLUME, "30");
-    WAIT(v["Volume"] == "30" && v["playerVolume"].asInt() == 30, 5000);
-    f.Ask(ACT_VOLUME_DOWN);
-    WAIT(v["Volume"] == "27", 5000);
-    f.Ask(ACT_VOLUME_UP);
-    f.Ask(ACT_VOLUME_UP);
-    WAIT(v["Volume"] == "30" || v["Volume"] == "33", 5000);
-    f.Ask(ACT_MUTE);
-    WAIT(v["Mute"] == "1" && v["playerMute"].asBool(), 5000);
-    f.Ask(ACT_MUTE);
-    WAIT(v["Mute"] == "0", 5000);
+    // Volume (clamped; steps from the last reported one) and mute toggles.
+    const struct {
+        int action;
+        const char *param, *volume, *mute;
+    } steps[] = {{ACT_SET_VOLUME, "50", "50", "0"}, {ACT_SET_VOLUME, "150", "100", "0"},
+                 {ACT_SET_VOLUME, "30", "30", "0"}, {ACT_VOLUME_DOWN, nullptr, "27", "0"},
+                 {ACT_VOLUME_UP, nullptr, "30", "0"}, {ACT_MUTE, nullptr, "30", "1"},
+                 {ACT_MUTE, nullptr, "30", "0"}};
+    for (auto &st : steps) {
+        f.Ask(st.action, st.param);
+        WAIT(v["Volume"] == st.volume && v["playerVolume"].asInt() == atoi(st.volume) &&
+             v["Mute"] == st.mute && v["playerMute"].asBool() == (*st.mute == '1'), 5000);
+    }
 
     // The queue moves on by itself at the end of song 0; song 1 is paused,
     // resumed and sought.
@@ -194,8 +185,6 @@ TEST(RendererPlayback, QueueTransportVolumeStatusRepeatOneAndLossOfTheRenderer)
     // Gone without a word: the player goes and the changed flag is set.
     f.Ask(ACT_CLEAR_CHANGED);
     kill(f.renderer, SIGKILL);
-    f.h.WaitExit(f.renderer, 5000);
-    f.renderer = 0;
     Json::Value list = f.Ask(ACT_LIST_RENDERERS, "0 0");
     for (long end = NowMs() + 20000; NowMs() < end && list["total"].asUInt() != 0;)
         usleep(250 * 1000), list = f.Ask(ACT_LIST_RENDERERS, "0 0");

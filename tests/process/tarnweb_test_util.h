@@ -3,7 +3,6 @@
 #ifndef TARN_TARNWEB_TEST_UTIL_H
 #define TARN_TARNWEB_TEST_UTIL_H
 
-#include <arpa/inet.h>
 #include <signal.h>
 #include <unistd.h>
 
@@ -12,6 +11,7 @@
 
 #include "platform/medialib.h"
 #include "tests/harness/harness.h"
+#include "tests/tools/fakedevice/fake_device.h"
 
 namespace tarnwebtest {
 
@@ -39,23 +39,6 @@ inline std::vector<MediaSong> MakeLibrary(tarntest::Harness &h, const char *dir,
     return songs;
 }
 
-// True once something accepts TCP connections on addr:port.
-inline bool WaitListening(const char *addr, int port, int timeoutMs)
-{
-    struct sockaddr_in a = {};
-    a.sin_family = AF_INET;
-    a.sin_port = htons(static_cast<uint16_t>(port));
-    inet_pton(AF_INET, addr, &a.sin_addr);
-    for (int waited = 0; waited < timeoutMs; waited += 50, usleep(50 * 1000)) {
-        int s = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        bool ok = connect(s, reinterpret_cast<struct sockaddr *>(&a), sizeof(a)) == 0;
-        close(s);
-        if (ok)
-            return true;
-    }
-    return false;
-}
-
 // Ends a child of the test by its pid: SIGTERM, then SIGKILL. Exit status.
 inline int EndChild(tarntest::Harness &h, pid_t &pid)
 {
@@ -68,15 +51,16 @@ inline int EndChild(tarntest::Harness &h, pid_t &pid)
     return status;
 }
 
-// tarnweb with args, once it listens on addr:port; 0 when it did not start.
-inline pid_t StartSongServer(tarntest::Harness &h, std::vector<std::string> args,
-                             const char *addr, int port)
+// tarnweb with args, once it listens on port 18080; 0 when it did not.
+inline pid_t StartSongServer(tarntest::Harness &h, std::vector<std::string> args)
 {
     args.insert(args.begin(), tarntest::BinPath("tarnweb"));
     pid_t pid = h.Spawn(args, true);
-    if (pid > 0 && !WaitListening(addr, port, 10000))
-        EndChild(h, pid);
-    return pid;
+    for (int waited = 0; pid > 0 && waited < 10000; waited += 50, usleep(50 * 1000))
+        if (!fakedev::ListeningAddress(18080).empty())
+            return pid;
+    EndChild(h, pid);
+    return 0;
 }
 
 }  // namespace tarnwebtest
