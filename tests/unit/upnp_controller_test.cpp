@@ -1,12 +1,15 @@
 // The control point's list rules, action answers and events, driven through the
-// controller's callbacks with libupnp records built here and recorded
-// descriptions and events of real devices. No libupnp start-up: nothing is sent.
+// controller's callbacks with libupnp records built here and events recorded
+// from a real renderer (no libupnp start-up: nothing is sent); the renderer
+// capability probe against a fake device on loopback.
 #include <gtest/gtest.h>
 
 #include <fstream>
-#include <sstream>
+#include <iterator>
 #include <string>
 
+#include "tests/tools/fakedevice/fake_device.h"
+#include "upnp/get_capability.h"
 #include "upnp/upnp.h"
 #include "upnp/upnp_sdk.h"
 #include "upnp/xml_util.h"
@@ -32,9 +35,7 @@ const uint32_t kNone = static_cast<uint32_t>(-1);
 std::string Fixture(const char *name)
 {
     std::ifstream in(std::string(TARN_SOURCE_DIR) + "/tests/fixtures/upnp/" + name);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
+    return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 IXML_Document *Parse(const std::string &text)
@@ -69,11 +70,13 @@ void AddServer(UpnpController &c, const std::string &udn, const std::string &nam
 // Nothing listens on port 1: the capability probe fails, the renderer is listed all the same.
 void AddRenderer(UpnpController &c, const std::string &udn, const std::string &name = "R")
 {
-    Add(c, false, "<root><device><friendlyName>" + name + "</friendlyName><UDN>" + udn +
-                      "</UDN><serviceList><service><serviceType>" + kAvt + "</serviceType><controlURL>/avt/" +
-                      udn + "</controlURL><eventSubURL>/avt/ev</eventSubURL><SCPDURL>/avt/scpd</SCPDURL>"
-                      "</service></serviceList></device></root>",
-        "http://127.0.0.1:1/d.xml");
+    std::string services;
+    for (const char *s : {"AVTransport", "RenderingControl"})
+        services += std::string("<service><serviceType>urn:schemas-upnp-org:service:") + s + ":1</serviceType>"
+                    "<controlURL>/" + s + "/" + udn + "</controlURL><eventSubURL>ev/" + s + "/" + udn +
+                    "</eventSubURL><SCPDURL>/" + s + ".xml</SCPDURL></service>";
+    Add(c, false, "<root><device><friendlyName>" + name + "</friendlyName><UDN>" + udn + "</UDN><serviceList>" +
+                      services + "</serviceList></device></root>", "http://127.0.0.1:1/d.xml");
 }
 
 int ByeBye(UpnpController &c, const char *type, const std::string &udn, int err = 0)
@@ -104,24 +107,6 @@ TEST(UpnpUrl, LocationHostPortAndServiceUrls)
     EXPECT_EQ("http://10.1.1.1:1/a", UpnpController::ResolveUrl("http://10.0.0.5:80", "http://10.1.1.1:1/a"));
 }
 
-TEST(UpnpServers, RecordedServerListedOnceWithItsKeys)
-{
-    UpnpController c;
-    for (int i = 0; i < 2; ++i)
-        Add(c, true, Fixture("minidlna_description.xml"), "http://10.77.0.2:8200/rootDesc.xml");
-    Json::Value reply;
-    ASSERT_EQ(0, c.GetServerList(reply, 0, 0));
-    ASSERT_EQ(1u, reply["total"].asUInt());
-    EXPECT_FALSE(reply.isMember("current"));
-    const Json::Value &s = reply["list"][0];
-    EXPECT_EQ(6u, s.size());
-    EXPECT_EQ("Test Server", s["friendly_name"].asString());
-    EXPECT_EQ("uuid:4d696e69-444c-164e-9d41-b827eb0a1b2c", s["udn"].asString());
-    EXPECT_EQ("10.77.0.2 8200", s["ip"].asString() + " " + s["port"].asString());
-    EXPECT_EQ("http://10.77.0.2:8200/ctl/ContentDir", s["control_url"].asString());
-    EXPECT_TRUE(s["index"].isInt());
-}
-
 TEST(UpnpServers, AdmissionSortingAndByeBye)
 {
     UpnpController c;
@@ -150,22 +135,18 @@ TEST(UpnpServers, AdmissionSortingAndByeBye)
     EXPECT_EQ(-1, c.FindServerByUdn(Uuid(1)));
 }
 
-TEST(UpnpRenderers, RecordedRendererUrlsAndListReply)
+TEST(UpnpRenderers, UrlsNoDuplicatesAndListReply)
 {
     UpnpController c;
-    for (int i = 0; i < 2; ++i)
-        Add(c, false, Fixture("gmediarender_description.xml"), "http://127.0.0.1:1/description.xml");
+    AddRenderer(c, "short", "r0");  // any UDN length, unlike servers
+    AddRenderer(c, "short", "r0");
     ASSERT_EQ(1u, c.RendererCount());
     RENDERER_INFO *r = A::Renderer(c, 0);
-    EXPECT_EQ("uuid:6a2c1f0e-3b7d-4c55-9e21-0a1b2c3d4e5f", r->udn);
-    EXPECT_EQ("Test Renderer", r->friendly_name);
-    EXPECT_EQ("http://127.0.0.1:1/upnp/control/rendertransport1", r->avt_control_url);
-    EXPECT_EQ("http://127.0.0.1:1/upnp/event/rendertransport1", r->avt_event_url);
-    EXPECT_EQ("http://127.0.0.1:1/upnp/control/rendercontrol1", r->rcs_control_url);
-    EXPECT_EQ("http://127.0.0.1:1/upnp/event/rendercontrol1", r->rcs_event_url);
-    EXPECT_EQ("http://127.0.0.1:1/upnp/rendercontrolSCPD.xml", r->rcs_scpd_url);
+    EXPECT_EQ("http://127.0.0.1:1/AVTransport/short http://127.0.0.1:1/ev/RenderingControl/short "
+              "http://127.0.0.1:1/RenderingControl.xml",
+              r->avt_control_url + " " + r->rcs_event_url + " " + r->rcs_scpd_url);
     EXPECT_FALSE(r->can_seek || r->can_set_volume);
-    AddRenderer(c, "short", "r1");  // any UDN length, unlike servers
+    AddRenderer(c, Uuid(1), "r1");
     AddRenderer(c, Uuid(2), "r2");
 
     struct { int start, limit; unsigned size; int first, replyLimit; } pages[] = {
@@ -187,7 +168,7 @@ TEST(UpnpRenderers, RecordedRendererUrlsAndListReply)
     EXPECT_NE(std::string::npos, Json::StyledWriter().write(reply).find("\"current\" : 4294967295"));
 }
 
-TEST(UpnpRenderers, RemovalSelectionAndState)
+TEST(UpnpRenderers, RemovalAndSelection)
 {
     struct { unsigned removed; uint32_t expected; } cases[] = {{1, kNone}, {0, 1}, {2, kNone}, {3, 2}};
     for (const auto &k : cases) {
@@ -200,28 +181,14 @@ TEST(UpnpRenderers, RemovalSelectionAndState)
         EXPECT_EQ(-1, c.FindRendererByUdn(Uuid(static_cast<int>(k.removed))));
     }
     UpnpController c;
-    Json::Value state;
-    EXPECT_EQ(-1, c.GetRendererState(state));
-    AddRenderer(c, Uuid(0), "Kitchen");
-    AddRenderer(c, Uuid(1), "Hall");
+    AddRenderer(c, Uuid(0));
+    AddRenderer(c, Uuid(1));
     EXPECT_EQ(-1, c.Play());  // nothing selected: nothing is sent
     EXPECT_EQ(-1, A::RemoveRenderer(c, 2));
     EXPECT_EQ(0, c.SelectRenderer(1));
     EXPECT_EQ(-1, c.SelectRenderer(2));
     EXPECT_EQ(1u, A::Current(c));  // unchanged by the failed selection
     EXPECT_EQ(-1, c.Seek(-1));
-    EXPECT_EQ(-1, c.SetAVTransportURI(nullptr, ""));
-    RENDERER_INFO *r = A::Renderer(c, 1);
-    r->current_uri = "http://x/1.mp3", r->duration = 245, r->rel_time = 12;
-    r->transport_state = "PLAYING", r->volume = "42", r->mute = "0";
-    ASSERT_EQ(0, c.GetRendererState(state));
-    EXPECT_EQ(8u, state.size());
-    EXPECT_EQ("http://x/1.mp3 245 12 PLAYING 1 Hall 42 0",
-              state["CurrentURI"].asString() + " " + std::to_string(state["Duration"].asInt()) + " " +
-                  std::to_string(state["RelTime"].asInt()) + " " + state["TransportState"].asString() + " " +
-                  std::to_string(state["RendererIndex"].asUInt()) + " " +
-                  state["RendererFriendlyName"].asString() + " " + state["Volume"].asString() + " " +
-                  state["Mute"].asString());
     EXPECT_EQ(0, ByeBye(c, kAvt, Uuid(1)));  // the AVTransport bye-bye removes it
     EXPECT_EQ(1u, c.RendererCount());
     EXPECT_EQ(kNone, A::Current(c));
@@ -258,9 +225,8 @@ const char kPosition[] = "<u:GetPositionInfoResponse xmlns:u=\"urn:x\"><TrackDur
 TEST(UpnpAnswers, AVTransportAnswersUpdateTheRecordAndRefusalsRemove)
 {
     UpnpController c;
-    Add(c, false, Fixture("gmediarender_description.xml"), "http://127.0.0.1:1/description.xml");
-    AddRenderer(c, Uuid(1));
-    AddRenderer(c, Uuid(2));
+    for (int i = 0; i < 3; ++i)
+        AddRenderer(c, Uuid(i));
     RENDERER_INFO *r = A::Renderer(c, 0);
     std::string url = r->avt_control_url;
     EXPECT_EQ(0, Answer(c, url, 0, kPosition));
@@ -295,7 +261,7 @@ class UpnpEvents : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        Add(c, false, Fixture("gmediarender_description.xml"), "http://127.0.0.1:1/description.xml");
+        AddRenderer(c, Uuid(0));
         r = A::Renderer(c, 0);
         Subscribe(r->avt_event_url, "uuid:avt-sid");
         Subscribe(r->rcs_event_url, "uuid:rcs-sid");
@@ -331,7 +297,7 @@ protected:
     RENDERER_INFO *r = nullptr;
 };
 
-TEST_F(UpnpEvents, RecordedAndCraftedLastChangeUpdateTheRecord)
+TEST_F(UpnpEvents, RecordedCraftedAndHostileLastChange)
 {
     EXPECT_EQ("uuid:avt-sid uuid:rcs-sid", r->avt_sid + " " + r->rcs_sid);
     EXPECT_EQ(0, Send("uuid:rcs-sid", Fixture("gmediarender_renderingcontrol_event.xml")));
@@ -355,11 +321,8 @@ TEST_F(UpnpEvents, RecordedAndCraftedLastChangeUpdateTheRecord)
     EXPECT_EQ(0, Send("uuid:rcs-sid", LastChange("<r:Event xmlns:r=\"urn:x\"><r:Volume val=\"99\"/></r:Event>")));
     EXPECT_EQ(0, Send("uuid:nobody", LastChange("<Event><Volume val=\"42\"/></Event>")));
     EXPECT_EQ("7", r->volume);
-}
 
-TEST_F(UpnpEvents, MalformedAndHostileLastChangeIsIgnored)
-{
-    r->volume = "5";
+    // Malformed, empty, deeply nested, crowded and oversized texts change nothing.
     std::string deep, flat = "<Event>";
     for (int i = 0; i < 20000; ++i)
         deep += "<a>";
@@ -375,9 +338,71 @@ TEST_F(UpnpEvents, MalformedAndHostileLastChangeIsIgnored)
     EXPECT_EQ(0, Send("uuid:rcs-sid", "<e:propertyset xmlns:e=\"urn:schemas-upnp-org:event-1-0\"><e:property>"
                                       "<LastChange><Event><Volume val=\"44\"/></Event></LastChange></e:property>"
                                       "</e:propertyset>"));  // an element, not text
-    EXPECT_EQ("5", r->volume);
+    EXPECT_EQ("7", r->volume);
     EXPECT_EQ(0, Send("uuid:rcs-sid", LastChange("<Event><Volume val=\"45\"/></Event>")));
     EXPECT_EQ("45", r->volume);
+}
+
+struct Doc {
+    IXML_Document *doc = nullptr;
+    explicit Doc(const std::string &text) { EXPECT_EQ(IXML_SUCCESS, ixmlParseBufferEx(text.c_str(), &doc)); }
+    ~Doc() { ixmlDocument_free(doc); }
+};
+
+std::string Replace(std::string text, const std::string &from, const std::string &to)
+{
+    size_t pos = text.find(from);
+    EXPECT_NE(std::string::npos, pos) << from;
+    return pos == std::string::npos ? text : text.replace(pos, from.size(), to);
+}
+
+TEST(UpnpCapability, SeekNeedsRelTimeAndVolumeNeedsSetVolume)
+{
+    std::string avt = fakedev::AvtScpd(), rcs = fakedev::RcsScpd();
+    struct { std::string text; bool seek, volume; } cases[] = {
+        {avt, true, false}, {rcs, false, true},
+        {Replace(avt, "<allowedValue>REL_TIME</allowedValue>", ""), false, false},
+        {Replace(avt, "<name>Seek</name>", "<name>Seek2</name>"), false, false},
+        {Replace(avt, "<name>A_ARG_TYPE_SeekMode</name>", "<name>A_ARG_TYPE_Other</name>"), false, false},
+        {Replace(rcs, "<name>SetVolume</name>", "<name>SetVolumeX</name>"), false, false},
+        {"<s:scpd xmlns:s=\"urn:x\"><s:actionList><s:action><s:name>SetVolume</s:name></s:action>"
+         "</s:actionList></s:scpd>", false, false}};  // prefixed names are not recognised
+    for (const auto &k : cases) {
+        Doc d(k.text);
+        EXPECT_EQ(k.seek, SupportsRelTimeSeek(d.doc)) << k.text;
+        EXPECT_EQ(k.volume, SupportsSetVolume(d.doc)) << k.text;
+    }
+    EXPECT_FALSE(SupportsRelTimeSeek(nullptr) || SupportsSetVolume(nullptr));
+}
+
+TEST(UpnpCapability, ProbeDownloadsBothDescriptionsAndFailuresLeaveBothFalse)
+{
+    fakedev::FakeHttpServer device;
+    ASSERT_GT(device.Start("127.0.0.1"), 0);
+    device.SetRoute("/rcs.xml", {fakedev::RcsScpd()});
+    device.SetRoute("/avt.xml", {fakedev::AvtScpd()});
+    RENDERER_INFO renderer;
+    renderer.rcs_scpd_url = device.BaseUrl() + "/rcs.xml";
+    renderer.avt_scpd_url = device.BaseUrl() + "/avt.xml";
+    Doc description(fakedev::DeviceDescription("uuid:x", "r", {}));
+    ASSERT_EQ(0, GetRendererCapability(description.doc, &renderer));
+    EXPECT_TRUE(renderer.can_seek && renderer.can_set_volume);
+    EXPECT_EQ(1u, device.RequestsOf("GET", "/avt.xml").size());
+    // A known limited model is capable of neither and downloads nothing.
+    Doc limited(Replace(fakedev::DeviceDescription("uuid:x", "r", {}), "<modelName>fake</modelName>",
+                        "<modelName>WD TV HD Live</modelName>"));
+    ASSERT_EQ(0, GetRendererCapability(limited.doc, &renderer));
+    EXPECT_FALSE(renderer.can_seek || renderer.can_set_volume);
+    EXPECT_EQ(1u, device.RequestsOf("GET", "/avt.xml").size());
+    // A broken AVTransport description; a missing RenderingControl one stops
+    // the probe before the AVTransport download.
+    device.SetRoute("/avt.xml", {"<scpd><actionList><action><name>Seek</name>"});
+    EXPECT_EQ(-1, GetRendererCapability(description.doc, &renderer));
+    EXPECT_FALSE(renderer.can_seek || renderer.can_set_volume);
+    renderer.rcs_scpd_url = device.BaseUrl() + "/missing.xml";
+    EXPECT_EQ(-1, GetRendererCapability(description.doc, &renderer));
+    EXPECT_EQ(2u, device.RequestsOf("GET", "/avt.xml").size());
+    EXPECT_EQ(-1, GetRendererCapability(nullptr, &renderer));
 }
 
 }  // namespace

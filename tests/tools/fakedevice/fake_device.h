@@ -1,5 +1,5 @@
 // A scriptable UPnP device for the control point's tests: a small HTTP server
-// (descriptions, service descriptions, SOAP actions, GENA subscriptions) whose
+// (descriptions, service descriptions, GENA subscriptions) whose
 // answers can also stall, never end, be cut off or be garbage, plus senders for
 // SSDP announcements and GENA events. Header only. It talks only to the
 // addresses the test gives it (loopback or the test namespace's veth pair).
@@ -18,7 +18,6 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <functional>
 #include <map>
 #include <mutex>
 #include <string>
@@ -35,14 +34,11 @@ struct Request {
     std::string Header(const char *name) const
     {
         size_t n = strlen(name);
-        for (size_t pos = head.find("\r\n"); pos != std::string::npos;) {
-            size_t end = head.find("\r\n", pos + 2);
-            std::string line = head.substr(pos + 2, end == std::string::npos ? end : end - pos - 2);
-            if (line.size() > n && strncasecmp(line.c_str(), name, n) == 0 && line[n] == ':')
-                return line.substr(line.find_first_not_of(' ', n + 1) == std::string::npos
-                                       ? line.size() : line.find_first_not_of(' ', n + 1));
-            pos = end;
-        }
+        for (size_t pos = head.find("\r\n"); pos != std::string::npos; pos = head.find("\r\n", pos + 2))
+            if (strncasecmp(head.c_str() + pos + 2, name, n) == 0 && head[pos + 2 + n] == ':') {
+                size_t v = head.find_first_not_of(' ', pos + 3 + n);
+                return head.substr(v, head.find("\r\n", v) - v);
+            }
         return std::string();
     }
 };
@@ -61,7 +57,15 @@ struct Route {
     Mode mode = Mode::Normal;
 };
 
-using SoapHandler = std::function<void(const Request &, std::string &body)>;
+// Sends all of text; false when the peer is gone.
+inline bool SendAll(int fd, const std::string &text)
+{
+    ssize_t n = 0;
+    for (size_t off = 0; off < text.size(); off += static_cast<size_t>(n))
+        if ((n = send(fd, text.data() + off, text.size() - off, MSG_NOSIGNAL)) <= 0)
+            return false;
+    return true;
+}
 
 class FakeHttpServer {
 public:
@@ -70,54 +74,46 @@ public:
     FakeHttpServer(const FakeHttpServer &) = delete;
     FakeHttpServer &operator=(const FakeHttpServer &) = delete;
 
-    // Listens on ip:port (0: any free port). Returns the port, or -1.
-    int Start(const char *ip, int port)
+    // Listens on ip, any free port. Returns the port, or -1.
+    int Start(const char *ip)
     {
-        listenFd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        int one = 1;
-        setsockopt(listenFd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof(one));
         sockaddr_in addr{};
         addr.sin_family = AF_INET;
-        addr.sin_port = htons(static_cast<uint16_t>(port));
         socklen_t len = sizeof(addr);
+        listenFd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
         if (listenFd < 0 || inet_pton(AF_INET, ip, &addr.sin_addr) != 1 ||
             bind(listenFd, reinterpret_cast<sockaddr *>(&addr), len) != 0 || listen(listenFd, 64) != 0 ||
-            getsockname(listenFd, reinterpret_cast<sockaddr *>(&addr), &len) != 0) {
-            if (listenFd >= 0)
-                close(listenFd);
-            return listenFd = -1;
-        }
-        host = ip;
-        boundPort = ntohs(addr.sin_port);
-        stopping = false;
-        acceptThread = std::thread([this] { AcceptLoop(); });
-        return boundPort;
+            getsockname(listenFd, reinterpret_cast<sockaddr *>(&addr), &len) != 0)
+            return -1;
+        base = std::string("http://") + ip + ":" + std::to_string(port = ntohs(addr.sin_port));
+        acceptThread = std::thread([this] {
+            for (pollfd p{listenFd, POLLIN, 0}; !stopping;) {
+                int fd = poll(&p, 1, 50) > 0 ? accept4(listenFd, nullptr, nullptr, SOCK_CLOEXEC) : -1;
+                if (fd >= 0)
+                    connThreads.emplace_back([this, fd] { Serve(fd); });
+            }
+        });
+        return port;
     }
-
     void Stop()
     {
-        if (listenFd < 0)
-            return;
         stopping = true;
-        acceptThread.join();
+        if (acceptThread.joinable())
+            acceptThread.join();
         for (std::thread &t : connThreads)  // the accept thread, which adds them, has ended
             t.join();
         connThreads.clear();
-        close(listenFd);
+        if (listenFd >= 0)
+            close(listenFd);
         listenFd = -1;
     }
 
-    std::string BaseUrl() const { return "http://" + host + ":" + std::to_string(boundPort); }
-    int Port() const { return boundPort; }
+    const std::string &BaseUrl() const { return base; }
+    int Port() const { return port; }
     void SetRoute(const std::string &path, const Route &route)
     {
         std::lock_guard<std::mutex> lock(mutex);
         routes[path] = route;
-    }
-    void SetSoapHandler(SoapHandler handler)
-    {
-        std::lock_guard<std::mutex> lock(mutex);
-        soap = std::move(handler);
     }
     // Requests whose method (and path, when given) match.
     std::vector<Request> RequestsOf(const char *method, const char *path = nullptr)
@@ -141,16 +137,6 @@ public:
     }
 
 private:
-    void AcceptLoop()
-    {
-        while (!stopping) {
-            pollfd p{listenFd, POLLIN, 0};
-            int fd = poll(&p, 1, 50) > 0 ? accept4(listenFd, nullptr, nullptr, SOCK_CLOEXEC) : -1;
-            if (fd >= 0)
-                connThreads.emplace_back([this, fd] { Serve(fd); });
-        }
-    }
-
     // Reads the headers and the announced body; false when the peer goes away
     // first, the server stops or 10 s pass.
     bool ReadRequest(int fd, Request &req)
@@ -158,7 +144,7 @@ private:
         std::string data;
         char buf[4096];
         size_t headEnd = std::string::npos, bodyLen = 0;
-        for (int waited = 0; waited < 10000;) {
+        for (int waited = 0; waited < 10000 && !stopping;) {
             if (headEnd == std::string::npos && (headEnd = data.find("\r\n\r\n")) != std::string::npos) {
                 req.head = data.substr(0, headEnd);
                 bodyLen = strtoul(req.Header("CONTENT-LENGTH").c_str(), nullptr, 10);
@@ -171,8 +157,6 @@ private:
                 return true;
             }
             pollfd p{fd, POLLIN, 0};
-            if (stopping)
-                return false;
             if (poll(&p, 1, 50) <= 0) {
                 waited += 50;
                 continue;
@@ -185,23 +169,11 @@ private:
         return false;
     }
 
-    static bool SendAll(int fd, const std::string &text)
-    {
-        for (size_t off = 0; off < text.size();) {
-            ssize_t n = send(fd, text.data() + off, text.size() - off, MSG_NOSIGNAL);
-            if (n <= 0)
-                return false;
-            off += static_cast<size_t>(n);
-        }
-        return true;
-    }
-
     static std::string Head(int status, size_t length, const std::string &extra = std::string())
     {
         return "HTTP/1.1 " + std::to_string(status) + (status == 200 ? " OK" : " Not Found") +
-               "\r\nCONTENT-TYPE: text/xml; charset=\"utf-8\"\r\nCONTENT-LENGTH: " +
-               std::to_string(length) + "\r\nSERVER: Linux/1.0 UPnP/1.0 fakedevice/1.0\r\n"
-               "CONNECTION: close\r\n" + extra + "\r\n";
+               "\r\nCONTENT-TYPE: text/xml; charset=\"utf-8\"\r\nCONTENT-LENGTH: " + std::to_string(length) +
+               "\r\nSERVER: Linux/1.0 UPnP/1.0 fakedevice/1.0\r\nCONNECTION: close\r\n" + extra + "\r\n";
     }
 
     void Serve(int fd)
@@ -210,97 +182,111 @@ private:
         if (ReadRequest(fd, req)) {
             std::unique_lock<std::mutex> lock(mutex);
             if (req.method == "SUBSCRIBE")
-                req.issuedSid = "uuid:fake-sid-" + std::to_string(boundPort) + "-" +
-                                std::to_string(requests.size());
+                req.issuedSid = "uuid:fake-sid-" + std::to_string(port) + "-" + std::to_string(requests.size());
             requests.push_back(req);
-            auto it = routes.find(req.path);
-            Route route = it == routes.end() ? Route() : it->second;
-            SoapHandler handler = soap;
+            bool found = routes.count(req.path) != 0;
+            Route route = found ? routes[req.path] : Route();
             lock.unlock();
+            std::string body = route.body, filler(16384, ' ');
             if (req.method == "SUBSCRIBE") {
                 SendAll(fd, Head(200, 0, "SID: " + req.issuedSid + "\r\nTIMEOUT: Second-1800\r\n"));
-            } else if (req.method == "POST" && handler) {
-                std::string body;
-                handler(req, body);
-                SendAll(fd, Head(200, body.size(), "EXT:\r\n") + body);
-            } else if (it == routes.end()) {
+            } else if (!found) {
                 SendAll(fd, Head(404, 0));
-            } else {
-                Answer(fd, route);
+            } else if (route.mode == Mode::Normal) {
+                SendAll(fd, Head(200, body.size()) + body);
+            } else if (route.mode == Mode::Stall) {
+                SendAll(fd, Head(200, body.size()) + body.substr(0, body.size() / 2));
+                while (!stopping)
+                    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+            } else if (route.mode == Mode::Endless || route.mode == Mode::Huge) {
+                SendAll(fd, (route.mode == Mode::Huge ? Head(200, 1000000000u)
+                                                      : "HTTP/1.1 200 OK\r\nCONNECTION: close\r\n\r\n") + body);
+                for (size_t sent = 0; !stopping && sent < 1000000000u && SendAll(fd, filler);)
+                    sent += filler.size();
+            } else if (route.mode == Mode::Garbage) {
+                SendAll(fd, "\x01\x02 this is not http \xff\xfe\r\n\r\n" + body);
             }
         }
         shutdown(fd, SHUT_RDWR);
         close(fd);
     }
 
-    void Answer(int fd, const Route &route)
-    {
-        const std::string &body = route.body;
-        switch (route.mode) {
-        case Mode::Normal:
-            SendAll(fd, Head(200, body.size()) + body);
-            break;
-        case Mode::Stall:
-            SendAll(fd, Head(200, body.size()) + body.substr(0, body.size() / 2));
-            while (!stopping)
-                std::this_thread::sleep_for(std::chrono::milliseconds(20));
-            break;
-        case Mode::Endless:
-        case Mode::Huge: {
-            SendAll(fd, (route.mode == Mode::Huge ? Head(200, 1000000000u)
-                                                  : "HTTP/1.1 200 OK\r\nCONNECTION: close\r\n\r\n") + body);
-            std::string filler(16384, ' ');
-            for (size_t sent = 0; !stopping && sent < 1000000000u && SendAll(fd, filler);)
-                sent += filler.size();
-            break;
-        }
-        case Mode::Close:
-            break;
-        case Mode::Garbage:
-            SendAll(fd, std::string("\x01\x02 this is not http \xff\xfe\r\n\r\n") + body);
-            break;
-        }
-    }
-
-    int listenFd = -1, boundPort = 0;
-    std::string host;
+    int listenFd = -1, port = 0;
+    std::string base;
     std::atomic<bool> stopping{false};
     std::thread acceptThread;
     std::vector<std::thread> connThreads;  // touched by the accept thread only, then by Stop
     std::mutex mutex;
     std::map<std::string, Route> routes;
-    SoapHandler soap;
     std::vector<Request> requests;
 };
 
-// Announces (alive) or withdraws (bye-bye) a device's service by one SSDP
-// NOTIFY from fromIp, out of the interface holding fromIp and looped back to
-// this host; the USN is "<udn>::<service type>". Returns 0 or -1.
-inline int AnnounceService(const char *fromIp, bool alive, const std::string &udn,
-                           const std::string &serviceType, const std::string &location)
+// Sends bytes over UDP (multicast: out of the interface holding fromIp, looped
+// back to this host) or TCP from fromIp to ip:port. For TCP returns the status
+// of the HTTP answer (-1 for none); for UDP 0 when sent, else -1.
+inline int SendRaw(int type, const std::string &fromIp, const std::string &ip, int port, const std::string &bytes)
 {
-    int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    if (fd < 0)
-        return -1;
+    int fd = socket(AF_INET, type | SOCK_CLOEXEC, 0), status = -1;
     sockaddr_in from{}, to{};
     from.sin_family = to.sin_family = AF_INET;
-    inet_pton(AF_INET, fromIp, &from.sin_addr);
-    setsockopt(fd, IPPROTO_IP, IP_MULTICAST_IF, &from.sin_addr, sizeof(from.sin_addr));
+    to.sin_port = htons(static_cast<uint16_t>(port));
+    inet_pton(AF_INET, fromIp.c_str(), &from.sin_addr);
+    inet_pton(AF_INET, ip.c_str(), &to.sin_addr);
     unsigned char ttl = 2, loop = 1;
+    setsockopt(fd, IPPROTO_IP, IP_MULTICAST_IF, &from.sin_addr, sizeof(from.sin_addr));
     setsockopt(fd, IPPROTO_IP, IP_MULTICAST_TTL, &ttl, sizeof(ttl));
     setsockopt(fd, IPPROTO_IP, IP_MULTICAST_LOOP, &loop, sizeof(loop));
     bind(fd, reinterpret_cast<sockaddr *>(&from), sizeof(from));
-    std::string msg = "NOTIFY * HTTP/1.1\r\nHOST: 239.255.255.250:1900\r\n";
-    if (alive)
-        msg += "CACHE-CONTROL: max-age=1800\r\nLOCATION: " + location +
-               "\r\nSERVER: Linux/1.0 UPnP/1.0 fakedevice/1.0\r\n";
-    msg += "NT: " + serviceType + "\r\nNTS: " + (alive ? "ssdp:alive" : "ssdp:byebye") +
-           "\r\nUSN: " + udn + "::" + serviceType + "\r\n\r\n";
-    to.sin_port = htons(1900);
-    inet_pton(AF_INET, "239.255.255.250", &to.sin_addr);
-    ssize_t n = sendto(fd, msg.data(), msg.size(), 0, reinterpret_cast<sockaddr *>(&to), sizeof(to));
+    if (type == SOCK_DGRAM) {
+        status = sendto(fd, bytes.data(), bytes.size(), 0, reinterpret_cast<sockaddr *>(&to), sizeof(to)) ==
+                 static_cast<ssize_t>(bytes.size()) ? 0 : -1;
+    } else if (connect(fd, reinterpret_cast<sockaddr *>(&to), sizeof(to)) == 0 && SendAll(fd, bytes)) {
+        char buf[1024] = "";
+        pollfd p{fd, POLLIN, 0};
+        if (poll(&p, 1, 5000) > 0 && recv(fd, buf, sizeof(buf) - 1, 0) > 0 && strncmp(buf, "HTTP/", 5) == 0)
+            status = atoi(strchr(buf, ' ') != nullptr ? strchr(buf, ' ') + 1 : "-1");
+    }
     close(fd);
-    return n == static_cast<ssize_t>(msg.size()) ? 0 : -1;
+    return status;
+}
+
+// Announces (alive) or withdraws (bye-bye) a device's service by one SSDP
+// NOTIFY; the USN is "<udn>::<service type>". Returns 0 or -1.
+inline int AnnounceService(const std::string &fromIp, bool alive, const std::string &udn,
+                           const std::string &serviceType, const std::string &location)
+{
+    return SendRaw(SOCK_DGRAM, fromIp, "239.255.255.250", 1900,
+                   "NOTIFY * HTTP/1.1\r\nHOST: 239.255.255.250:1900\r\n" +
+                       (alive ? "CACHE-CONTROL: max-age=1800\r\nLOCATION: " + location +
+                                    "\r\nSERVER: Linux/1.0 UPnP/1.0 fakedevice/1.0\r\n"
+                              : std::string()) +
+                       "NT: " + serviceType + "\r\nNTS: " + (alive ? "ssdp:alive" : "ssdp:byebye") +
+                       "\r\nUSN: " + udn + "::" + serviceType + "\r\n\r\n");
+}
+
+// Sends one GENA NOTIFY carrying body to a subscriber's CALLBACK URL
+// ("<http://ip:port/path>") and returns the HTTP status of its answer, or -1.
+inline int SendGenaEvent(const std::string &callback, const std::string &sid, int seq, const std::string &body)
+{
+    size_t colon = callback.find(':', 8), slash = callback.find('/', 8);
+    if (callback.compare(0, 8, "<http://") != 0 || colon > slash || slash == std::string::npos)
+        return -1;
+    std::string host = callback.substr(8, colon - 8);
+    return SendRaw(SOCK_STREAM, "0.0.0.0", host, atoi(callback.c_str() + colon + 1),
+                   "NOTIFY " + callback.substr(slash, callback.find('>') - slash) + " HTTP/1.1\r\nHOST: " +
+                       callback.substr(8, slash - 8) + "\r\nCONTENT-TYPE: text/xml; charset=\"utf-8\"\r\n"
+                       "NT: upnp:event\r\nNTS: upnp:propchange\r\nSID: " + sid + "\r\nSEQ: " + std::to_string(seq) +
+                       "\r\nCONTENT-LENGTH: " + std::to_string(body.size()) + "\r\n\r\n" + body);
+}
+
+// The body of a GENA event carrying one LastChange text (escaped here).
+inline std::string LastChangeEvent(const std::string &lastChange)
+{
+    std::string escaped;
+    for (char c : lastChange)
+        escaped += c == '<' ? "&lt;" : c == '>' ? "&gt;" : c == '&' ? "&amp;" : std::string(1, c);
+    return "<e:propertyset xmlns:e=\"urn:schemas-upnp-org:event-1-0\"><e:property><LastChange>" + escaped +
+           "</LastChange></e:property></e:propertyset>";
 }
 
 // The IPv4 address on which some process of this network namespace listens on
@@ -330,90 +316,33 @@ inline void PeerInterface(const std::string &controlPointIp, std::string &ip, st
     iface = first ? "tveth1" : "tveth0";
 }
 
-// Sends one GENA NOTIFY to a subscriber's CALLBACK URL ("<http://ip:port/path>")
-// and returns the HTTP status of its answer, or -1.
-inline int SendGenaEvent(std::string url, const std::string &sid, int seq, const std::string &body)
-{
-    if (!url.empty() && url[0] == '<')
-        url = url.substr(1, url.find('>') - 1);
-    size_t slash = url.find('/', 7), colon = url.find(':', 7);
-    if (url.compare(0, 7, "http://") != 0 || slash == std::string::npos || colon > slash)
-        return -1;
-    std::string host = url.substr(7, colon - 7);
-    sockaddr_in addr{};
-    addr.sin_family = AF_INET;
-    addr.sin_port = htons(static_cast<uint16_t>(atoi(url.c_str() + colon + 1)));
-    inet_pton(AF_INET, host.c_str(), &addr.sin_addr);
-    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0 || connect(fd, reinterpret_cast<sockaddr *>(&addr), sizeof(addr)) != 0) {
-        if (fd >= 0)
-            close(fd);
-        return -1;
-    }
-    std::string msg = "NOTIFY " + url.substr(slash) + " HTTP/1.1\r\nHOST: " + url.substr(7, slash - 7) +
-                      "\r\nCONTENT-TYPE: text/xml; charset=\"utf-8\"\r\nNT: upnp:event\r\n"
-                      "NTS: upnp:propchange\r\nSID: " + sid + "\r\nSEQ: " + std::to_string(seq) +
-                      "\r\nCONTENT-LENGTH: " + std::to_string(body.size()) + "\r\n\r\n" + body;
-    for (size_t off = 0; off < msg.size();) {
-        ssize_t n = send(fd, msg.data() + off, msg.size() - off, MSG_NOSIGNAL);
-        if (n <= 0)
-            break;
-        off += static_cast<size_t>(n);
-    }
-    std::string answer;
-    char buf[1024];
-    pollfd p{fd, POLLIN, 0};
-    ssize_t n;
-    while (answer.find("\r\n") == std::string::npos && poll(&p, 1, 5000) > 0 &&
-           (n = recv(fd, buf, sizeof(buf), 0)) > 0)
-        answer.append(buf, static_cast<size_t>(n));
-    close(fd);
-    return answer.compare(0, 5, "HTTP/") == 0 && answer.find(' ') != std::string::npos
-               ? atoi(answer.c_str() + answer.find(' ') + 1) : -1;
-}
-
-// The body of a GENA event carrying one LastChange text (escaped here).
-inline std::string LastChangeEvent(const std::string &lastChange)
-{
-    std::string escaped;
-    for (char c : lastChange)
-        escaped += c == '<' ? "&lt;" : c == '>' ? "&gt;" : c == '&' ? "&amp;" : c == '"' ? "&quot;"
-                                                                                         : std::string(1, c);
-    return "<e:propertyset xmlns:e=\"urn:schemas-upnp-org:event-1-0\"><e:property><LastChange>" +
-           escaped + "</LastChange></e:property></e:propertyset>";
-}
-
 // A renderer description with the given services (type, base name) whose URLs
 // are /<name>/scpd.xml, /<name>/control and /<name>/event.
 inline std::string DeviceDescription(const std::string &udn, const std::string &name,
                                      const std::vector<std::pair<std::string, std::string>> &services)
 {
-    std::string xml = "<?xml version=\"1.0\"?>\n<root xmlns=\"urn:schemas-upnp-org:device-1-0\">"
-                      "<specVersion><major>1</major><minor>0</minor></specVersion><device>"
-                      "<deviceType>urn:schemas-upnp-org:device:MediaRenderer:1</deviceType>"
-                      "<friendlyName>" + name + "</friendlyName><modelName>fake</modelName><UDN>" +
-                      udn + "</UDN><serviceList>";
+    std::string xml = "<?xml version=\"1.0\"?>\n<root xmlns=\"urn:schemas-upnp-org:device-1-0\"><device>"
+                      "<deviceType>urn:schemas-upnp-org:device:MediaRenderer:1</deviceType><friendlyName>" +
+                      name + "</friendlyName><modelName>fake</modelName><UDN>" + udn + "</UDN><serviceList>";
     for (const auto &s : services)
-        xml += "<service><serviceType>" + s.first + "</serviceType><serviceId>urn:upnp-org:serviceId:" +
-               s.second + "</serviceId><SCPDURL>/" + s.second + "/scpd.xml</SCPDURL><controlURL>/" +
-               s.second + "/control</controlURL><eventSubURL>/" + s.second + "/event</eventSubURL></service>";
+        xml += "<service><serviceType>" + s.first + "</serviceType><SCPDURL>/" + s.second + "/scpd.xml</SCPDURL>"
+               "<controlURL>/" + s.second + "/control</controlURL><eventSubURL>/" + s.second +
+               "/event</eventSubURL></service>";
     return xml + "</serviceList></device></root>\n";
 }
 
-// Service descriptions as small as the capability probe accepts: AVTransport
+// The smallest service descriptions the capability probe accepts: AVTransport
 // with Seek by REL_TIME, RenderingControl with SetVolume.
 inline std::string AvtScpd()
 {
-    return "<?xml version=\"1.0\"?><scpd xmlns=\"urn:schemas-upnp-org:service-1-0\"><actionList>"
-           "<action><name>Seek</name></action></actionList><serviceStateTable><stateVariable>"
-           "<name>A_ARG_TYPE_SeekMode</name><dataType>string</dataType><allowedValueList>"
-           "<allowedValue>ABS_TIME</allowedValue><allowedValue>REL_TIME</allowedValue>"
-           "</allowedValueList></stateVariable></serviceStateTable></scpd>";
+    return "<scpd><actionList><action><name>Seek</name></action></actionList><serviceStateTable>"
+           "<stateVariable><name>A_ARG_TYPE_SeekMode</name><allowedValueList><allowedValue>ABS_TIME"
+           "</allowedValue><allowedValue>REL_TIME</allowedValue></allowedValueList></stateVariable>"
+           "</serviceStateTable></scpd>";
 }
 inline std::string RcsScpd()
 {
-    return "<?xml version=\"1.0\"?><scpd xmlns=\"urn:schemas-upnp-org:service-1-0\"><actionList>"
-           "<action><name>SetVolume</name></action></actionList><serviceStateTable/></scpd>";
+    return "<scpd><actionList><action><name>SetVolume</name></action></actionList></scpd>";
 }
 
 }  // namespace fakedev
