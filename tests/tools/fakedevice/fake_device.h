@@ -109,7 +109,6 @@ public:
     }
 
     const std::string &BaseUrl() const { return base; }
-    int Port() const { return port; }
     void SetRoute(const std::string &path, const Route &route)
     {
         std::lock_guard<std::mutex> lock(mutex);
