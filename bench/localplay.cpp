@@ -34,6 +34,20 @@
 
 namespace {
 
+// Seconds of silence (|x| <= threshold) around time `at`.
+double GapAround(const localplay::Wav &wav, double at, int threshold = 200)
+{
+    long n = long(wav.left.size()), before = long(at * wav.rate), after = before;
+    if (before < 0 || before >= n)
+        return -1;
+    while (before > 0 && std::abs(wav.left[before]) <= threshold)
+        --before;
+    while (after < n - 1 && std::abs(wav.left[after]) <= threshold)
+        ++after;
+    return double(after - before - 1) / wav.rate;
+}
+
+
 using Clock = std::chrono::steady_clock;
 using tarntest::Harness;
 using tarntest::MakeMediaInfo;
@@ -242,7 +256,7 @@ public:
                 continue;
             }
             double end1 = found[0].start + found[0].length;
-            silences.push_back(localplay::GapAround(wav, (end1 + found[1].start) / 2) * 1000);
+            silences.push_back(GapAround(wav, (end1 + found[1].start) / 2) * 1000);
 
             // The output grows in blocks of the decoder's size d, each
             // written when its playback starts. Right after a block arrives

@@ -1,7 +1,7 @@
 // Reading what mplayer-daemon wrote to its WAV output (TARN_AUDIO_OUT=wav:PATH),
 // 16-bit PCM. The test songs are sine tones: a short window's frequency comes
 // from its zero crossings, its loudness from its RMS. Used by the playback
-// tests and the local playback benchmark.
+// tests and bench/localplay.cpp.
 #ifndef TARN_TEST_LOCALPLAY_WAV_H
 #define TARN_TEST_LOCALPLAY_WAV_H
 
@@ -11,7 +11,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
-#include <sstream>
+#include <iterator>
 #include <string>
 #include <vector>
 
@@ -29,10 +29,8 @@ struct Wav {
 inline bool LoadWav(const std::string &path, Wav *wav)
 {
     std::ifstream in(path, std::ios::binary);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    const std::string d = ss.str();
-    if (!in || d.size() < 12 || d.compare(0, 4, "RIFF") != 0 || d.compare(8, 4, "WAVE") != 0)
+    const std::string d((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    if (d.size() < 12 || d.compare(0, 4, "RIFF") != 0 || d.compare(8, 4, "WAVE") != 0)
         return false;
     auto u = [&](size_t at, int n) { uint32_t v = 0; memcpy(&v, d.data() + at, n); return v; };
     int bits = 0;
@@ -112,25 +110,11 @@ inline std::vector<Run> ToneRuns(const Wav &wav, const std::vector<double> &tone
 // RMS of the output between two times (seconds).
 inline double RmsBetween(const Wav &wav, double from, double to)
 {
-    size_t a = size_t(std::max(0.0, from) * wav.rate);
-    size_t b = std::min(wav.left.size(), size_t(std::max(0.0, to) * wav.rate));
+    size_t a = size_t(std::max(0.0, from) * wav.rate), b = std::min(wav.left.size(), size_t(to * wav.rate));
     double sum = 0;
     for (size_t i = a; i < b; ++i)
         sum += double(wav.left[i]) * wav.left[i];
     return b > a ? std::sqrt(sum / (b - a)) : 0.0;
-}
-
-// Seconds of silence (|x| <= threshold) around time `at`.
-inline double GapAround(const Wav &wav, double at, int threshold = 200)
-{
-    long n = long(wav.left.size()), before = long(at * wav.rate), after = before;
-    if (before < 0 || before >= n)
-        return -1;
-    while (before > 0 && std::abs(wav.left[before]) <= threshold)
-        --before;
-    while (after < n - 1 && std::abs(wav.left[after]) <= threshold)
-        ++after;
-    return double(after - before - 1) / wav.rate;
 }
 
 }  // namespace localplay

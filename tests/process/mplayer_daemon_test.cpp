@@ -1,15 +1,19 @@
-// The real mplayer-daemon against a test-side command socket and player
-// status segment: songs of several formats played into one WAV file, garbage
-// on the command stream, the ways the process ends, and an internet radio
-// stream from a small ICY server on 127.0.0.1 with changing stream titles.
+// Local playback end to end: the real tarnaudiod starts the real
+// mplayer-daemon, which plays generated tone songs into a WAV file. The WAV
+// shows what was played and that commands took effect; the published segment
+// and the status reply show what the daemon reports. Then mplayer-daemon
+// alone against a test-side command socket and player status segment: every
+// format, bad songs, a radio stream from an ICY server.
 #include <gtest/gtest.h>
 
+#include <httplib.h>
+#include <json/json.h>
 #include <poll.h>
 #include <signal.h>
 #include <sys/shm.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -19,8 +23,6 @@
 #include <thread>
 #include <vector>
 
-#include <httplib.h>
-
 #include "daemon/tarn_types.h"
 #include "platform/tarn_env.h"
 #include "tests/harness/harness.h"
@@ -29,11 +31,14 @@
 
 namespace {
 
-bool WaitFor(const std::function<bool()> &cond, int timeoutMs)
+using tarntest::MakeMediaInfo;
+const std::vector<double> kTones = {440.0, 660.0, 880.0};
+
+bool WaitFor(const std::function<bool()> &pred, int timeoutMs)
 {
     auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
     for (;;) {
-        if (cond())
+        if (pred())
             return true;
         if (std::chrono::steady_clock::now() >= end)
             return false;
@@ -42,46 +47,268 @@ bool WaitFor(const std::function<bool()> &cond, int timeoutMs)
 }
 void SleepMs(int ms) { std::this_thread::sleep_for(std::chrono::milliseconds(ms)); }
 
-// A sine tone file; the format follows the extension (mp3 through lame, m4a
-// through GStreamer, the rest through sox).
-bool MakeTone(const std::string &path, int freq, int seconds, int rate = 44100, int channels = 2)
+std::string Describe(const std::vector<localplay::Run> &runs)
 {
-    std::string q = "'" + path + "'", ext = path.substr(path.rfind('.') + 1);
-    std::string sox = "sox -n -r " + std::to_string(rate) + " -c " + std::to_string(channels) +
-                      " -b 16 %s synth " + std::to_string(seconds) + " sine " +
-                      std::to_string(freq) + " vol 0.5";
-    std::string cmd;
-    if (ext == "mp3")
-        cmd = "sox -n -r 44100 -c 2 -b 16 -t wav - synth " + std::to_string(seconds) + " sine " +
-              std::to_string(freq) + " vol 0.5 | lame --quiet -b 128 -t - " + q;
-    else if (ext == "m4a")
-        cmd = "gst-launch-1.0 -q audiotestsrc num-buffers=" + std::to_string(seconds * rate / 1024) +
-              " samplesperbuffer=1024 freq=" + std::to_string(freq) + " volume=0.5 ! audio/x-raw,rate=" +
-              std::to_string(rate) + " ! audioconvert ! avenc_aac ! mp4mux ! filesink location=" + q;
-    else
-        cmd = sox.replace(sox.find("%s"), 2, q);
-    return system((cmd + " >/dev/null 2>&1").c_str()) == 0;
+    std::string s;
+    for (const localplay::Run &r : runs)
+        s += std::to_string(int(kTones[r.tone])) + " Hz " + std::to_string(r.length) + " s; ";
+    return s;
 }
 
-std::string Padded(const std::string &text)
+class LocalPlaybackTest : public ::testing::Test {
+protected:
+    void SetUp() override
+    {
+        ASSERT_TRUE(tarntest::InPrivateNetns()) << "run under scripts/netns-run";
+        std::string out, songs = h.Path("/songs");
+        ASSERT_EQ(0, h.Run({"/bin/sh", tarntest::SourcePath("scripts/make-demo-songs.sh"), songs, "2"}, &out)) << out;
+        ASSERT_EQ(0, h.Run({"/usr/bin/sox", "-q", "-n", "-r", "44100", "-c", "2", "-b", "16", songs + "/long-440.wav",
+                            "synth", "30", "sine", "440", "gain", "-6"}, &out)) << out;
+        wavPath = h.Root() + "/out.wav";
+        setenv("TARN_AUDIO_OUT", ("wav:" + wavPath).c_str(), 1);
+        ASSERT_EQ(0, h.Start()) << h.Error();
+    }
+    void TearDown() override
+    {
+        if (HasFailure())
+            fprintf(stderr, "--- daemon log ---\n%s\n", h.Log().c_str());
+    }
+
+    std::string Song(const char *name) const { return h.Path("/songs/") + name; }
+    void Add(const char *file, const char *title = "", float seconds = 2.0f)
+    {
+        ASSERT_EQ(0, h.QueueAdd(MakeMediaInfo(Song(file), title, "Tarn Demo Band", seconds)));
+    }
+    Json::Value Status()
+    {
+        std::string text;
+        Json::Value v;
+        if (h.Request(ACT_GET_STATUS, nullptr, &text, 1000) == 0)
+            Json::Reader().parse(text, v);
+        return v;
+    }
+    // The daemon dropped the connection and the player's pid file is gone.
+    bool Stopped()
+    {
+        Json::Value s = Status();
+        return s.isObject() && s["fdMplayer"].asInt() == -1 && !h.Exists(TARN_MPLAYER_PID_FILE);
+    }
+    void StopAndWait()
+    {
+        ASSERT_EQ(0, h.Request(ACT_STOP, nullptr, nullptr, 3000));
+        ASSERT_TRUE(WaitFor([&] { return Stopped(); }, 5000));
+    }
+    std::vector<localplay::Run> Runs(localplay::Wav *out = nullptr)
+    {
+        localplay::Wav wav;
+        EXPECT_TRUE(localplay::LoadWav(wavPath, &wav)) << wavPath;
+        if (out)
+            *out = wav;
+        return localplay::ToneRuns(wav, kTones);
+    }
+    double WavSeconds()
+    {
+        struct stat st;
+        return stat(wavPath.c_str(), &st) == 0 && st.st_size >= 44
+                   ? double(st.st_size - 44) / (44100.0 * 4) : 0.0;
+    }
+    int MplayerPid() { return atoi(h.ReadFile(TARN_MPLAYER_PID_FILE).c_str()); }
+
+    tarntest::Harness h;
+    std::string wavPath;
+};
+
+TEST_F(LocalPlaybackTest, QueuePlaysThroughAndEachSongFollows)
 {
-    std::string b(2048, '\0');
-    return b.replace(0, text.size(), text);
+    Add("tone-440.mp3", "Demo Tone A440");
+    Add("tone-660.flac", "Demo Tone E660");
+    Add("tone-880.ogg", "Demo Tone A880");
+    ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "0"));
+    ASSERT_TRUE(WaitFor([&] { return Status()["fdMplayer"].asInt() >= 0; }, 5000))
+        << "mplayer-daemon did not connect";
+    std::vector<std::string> titles;
+    bool sawArtist = false, sawPosition = false, sawPlaying = false;
+    ASSERT_TRUE(WaitFor(
+        [&] {
+            const PublishedStatusShm *pub = h.PublishedSegment();
+            if (pub && pub->currentUri[0]) {
+                std::string t(pub->title, strnlen(pub->title, sizeof(pub->title)));
+                if (titles.empty() || titles.back() != t)
+                    titles.push_back(t);
+                sawArtist = sawArtist || std::string(pub->artist) == "Tarn Demo Band";
+                sawPosition = sawPosition || (pub->position >= 1 && pub->duration == 2);
+                sawPlaying = sawPlaying || pub->state == PLAYER_STATE_PLAYING;
+            }
+            return Stopped();
+        },
+        20000))
+        << "playback did not stop at the end of the queue";
+    EXPECT_EQ((std::vector<std::string>{"Demo Tone A440", "Demo Tone E660", "Demo Tone A880"}),
+              titles);
+    EXPECT_TRUE(sawArtist && sawPosition && sawPlaying);
+    EXPECT_EQ(0, Status()["PlayerState"].asInt());
+
+    std::vector<localplay::Run> runs = Runs();
+    ASSERT_EQ(3u, runs.size()) << Describe(runs);
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_EQ(i, runs[i].tone) << Describe(runs);
+        EXPECT_NEAR(2.0, runs[i].length, 0.15) << Describe(runs);
+        double gap = i > 0 ? runs[i].start - (runs[i - 1].start + runs[i - 1].length) : 0;
+        EXPECT_LT(gap, 0.5) << "each song follows without a noticeable pause";
+    }
 }
+
+// "Repeat One" plays the second song again and again; "Repeat All" wraps
+// to the first song after the last, each song played through.
+TEST_F(LocalPlaybackTest, RepeatOneAndRepeatAll)
+{
+    Add("tone-880.ogg");
+    Add("tone-660.flac");
+    struct Case { const char *mode, *index; double seconds; std::string tones; } cases[] = {
+        {"2", "1", 5.5, "1"}, {"3", "0", 8.8, "21212"}};
+    for (const Case &c : cases) {
+        SCOPED_TRACE(c.mode);
+        ASSERT_EQ(0, h.Request(ACT_SET_REPEAT_MODE, c.mode));
+        ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, c.index));
+        ASSERT_TRUE(WaitFor([&] { return WavSeconds() >= c.seconds; }, 20000));
+        const PublishedStatusShm *pub = h.PublishedSegment();
+        ASSERT_NE(nullptr, pub);
+        EXPECT_EQ(atoi(c.mode), pub->repeatMode);
+        StopAndWait();
+        localplay::Wav wav;
+        std::vector<localplay::Run> runs = Runs(&wav);
+        EXPECT_TRUE(wav.sizesFinal) << "the stopped player completes its WAV file";
+        ASSERT_EQ(0, unlink(wavPath.c_str()));
+        std::string tones;
+        double total = 0;
+        for (size_t i = 0; i < runs.size(); ++i) {
+            tones += std::to_string(runs[i].tone);
+            total += runs[i].length;
+            bool whole = c.tones.size() > 1 && i + 1 < runs.size();  // songs played through
+            EXPECT_NEAR(2.0, whole ? runs[i].length : 2.0, 0.15) << Describe(runs);
+        }
+        EXPECT_EQ(0u, tones.find(c.tones)) << Describe(runs);
+        EXPECT_EQ(std::string::npos, tones.find_first_not_of(c.tones)) << Describe(runs);
+        EXPECT_GE(total, c.seconds - 1.0) << Describe(runs);
+    }
+}
+
+TEST_F(LocalPlaybackTest, PauseSeekVolumeMuteAndEqualizerReachThePlayer)
+{
+    Add("long-440.wav", "Long", 30.0f);
+    ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "0"));
+    ASSERT_TRUE(WaitFor([&] { return Status()["Position"].asInt() >= 1; }, 10000));
+    EXPECT_EQ(50, Status()["Volume"].asInt());
+
+    // Pause: state 3 reported and published, the output stops growing.
+    ASSERT_EQ(0, h.Request(ACT_PLAY_PAUSE));
+    ASSERT_TRUE(WaitFor([&] { return Status()["PlayerState"].asInt() == 3; }, 3000));
+    ASSERT_TRUE(WaitFor([&] { return h.PublishedSegment()->state == 3; }, 1000));
+    double pausedAt = WavSeconds();
+    SleepMs(1000);
+    EXPECT_LT(WavSeconds() - pausedAt, 0.2);
+    ASSERT_EQ(0, h.Request(ACT_PLAY_PAUSE));
+    ASSERT_TRUE(WaitFor([&] { return Status()["PlayerState"].asInt() == 2; }, 3000));
+
+    ASSERT_EQ(0, h.Request(ACT_SEEK, "15"));
+    ASSERT_TRUE(WaitFor([&] { return Status()["Position"].asInt() >= 15; }, 3000));
+    EXPECT_LT(Status()["Position"].asInt(), 19);
+
+    // Output windows after each step: volume 50, volume 20, muted, unmuted,
+    // equalizer -20 dB (heard about a second later, behind the player's buffer).
+    struct Step { int action; const char *param; int settleMs; } steps[] = {
+        {0, nullptr, 600}, {ACT_SET_VOLUME, "20", 500}, {ACT_MUTE, nullptr, 500},
+        {ACT_MUTE, nullptr, 500},
+        {ACT_SET_EQUALIZER, "-20.0 -20.0 -20.0 -20.0 -20.0 -20.0 -20.0 -20.0 -20.0 -20.0", 2000}};
+    std::vector<std::pair<double, double>> windows;
+    for (const Step &s : steps) {
+        ASSERT_EQ(0, s.action ? h.Request(s.action, s.param) : 0);
+        SleepMs(s.settleMs);
+        double t0 = WavSeconds();
+        SleepMs(600);
+        windows.emplace_back(t0, WavSeconds());
+    }
+    EXPECT_EQ(20, Status()["Volume"].asInt());
+    StopAndWait();
+
+    localplay::Wav wav;
+    Runs(&wav);
+    double r[5];
+    for (int i = 0; i < 5; ++i)
+        r[i] = localplay::RmsBetween(wav, windows[i].first, windows[i].second);
+    std::string figures = "rms at volume 50, 20, muted, unmuted, -20 dB:";
+    for (double v : r)
+        figures += " " + std::to_string(int(v));
+    EXPECT_GT(r[0], 1000) << figures;
+    EXPECT_LT(r[1], r[0] * 0.75) << figures;
+    EXPECT_GT(r[1], r[0] * 0.05) << figures;
+    EXPECT_LT(r[2], 50) << figures;
+    EXPECT_NEAR(r[1], r[3], r[1] * 0.2) << figures;
+    EXPECT_LT(r[4], r[3] * 0.3) << figures;
+    EXPECT_LT(wav.Seconds(), 20.0);  // the seek skipped audio
+}
+
+// A stopped (SIGSTOP) or killed (SIGKILL) player never holds the daemon up.
+TEST_F(LocalPlaybackTest, HungOrKilledPlayerDoesNotBlockTheDaemon)
+{
+    Add("long-440.wav", "Long", 30.0f);
+    Add("tone-660.flac");
+    ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "0"));
+    ASSERT_TRUE(WaitFor([&] { return Status()["Position"].asInt() >= 1; }, 10000));
+    int pid = MplayerPid();
+    ASSERT_GT(pid, 0);
+
+    // Enough padded commands to fill the connection many times over.
+    ASSERT_EQ(0, kill(pid, SIGSTOP));
+    for (int i = 0; i < 300; ++i) {
+        int action = (i % 3 == 0) ? ACT_SET_VOLUME : (i % 3 == 1) ? ACT_MUTE : ACT_SEEK;
+        ASSERT_EQ(0, h.Request(action, "10", nullptr, 1000)) << "request " << i;
+    }
+    EXPECT_TRUE(h.WaitLog("MPlayer fd is not writable now", 2000));
+    ASSERT_EQ(0, h.Request(ACT_NEXT, nullptr, nullptr, 1000));
+    ASSERT_EQ(0, h.Request(ACT_PLAY_PAUSE, nullptr, nullptr, 1000));
+    EXPECT_TRUE(Status().isObject());
+
+    // Killed: the daemon goes on answering; play starts a new player.
+    ASSERT_EQ(0, kill(pid, SIGKILL));
+    kill(pid, SIGCONT);
+    ASSERT_TRUE(WaitFor([&] { h.Reap(); return kill(pid, 0) != 0; }, 3000));
+    for (int action : {ACT_SET_VOLUME, ACT_MUTE, ACT_SEEK, ACT_NEXT, ACT_PREVIOUS})
+        ASSERT_EQ(0, h.Request(action, "30", nullptr, 1000)) << "action " << action;
+    EXPECT_TRUE(Status().isObject());
+    ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "1", nullptr, 1000));
+    ASSERT_TRUE(WaitFor([&] { return MplayerPid() > 0 && MplayerPid() != pid; }, 5000));
+    const PublishedStatusShm *pub = h.PublishedSegment();
+    ASSERT_TRUE(WaitFor([&] { return pub && std::string(pub->currentUri) == Song("tone-660.flac") &&
+                                     pub->state == PLAYER_STATE_PLAYING && pub->index == 1; }, 5000));
+    ASSERT_TRUE(WaitFor([&] { return Stopped(); }, 10000));
+}
+
+// A sine tone file: mp3 through lame, m4a through GStreamer, others through sox.
+bool MakeTone(const std::string &path, int freq, int seconds, int rate = 44100, int channels = 2)
+{
+    std::string q = "'" + path + "'", ext = path.substr(path.rfind('.') + 1), f = std::to_string(freq);
+    std::string sox = "sox -n -r " + std::to_string(rate) + " -c " + std::to_string(channels) + " -b 16 " +
+                      (ext == "mp3" ? "-t wav -" : q) + " synth " + std::to_string(seconds) + " sine " + f +
+                      " vol 0.5" + (ext == "mp3" ? " | lame --quiet -b 128 -t - " + q : "");
+    std::string gst = "gst-launch-1.0 -q audiotestsrc num-buffers=" + std::to_string(seconds * rate / 1024) +
+                      " samplesperbuffer=1024 freq=" + f + " volume=0.5 ! audio/x-raw,rate=" +
+                      std::to_string(rate) + " ! audioconvert ! avenc_aac ! mp4mux ! filesink location=" + q;
+    return system(((ext == "m4a" ? gst : sox) + " >/dev/null 2>&1").c_str()) == 0;
+}
+
+std::string Padded(const std::string &text) { return text + std::string(2048 - text.size(), '\0'); }
 std::string Load(const std::string &uri) { return "loadfile \"" + MplayerEscapeUri(uri) + "\""; }
 std::string Text(const volatile char *p, size_t n)
 {
-    std::string s;
-    for (size_t i = 0; i < n && p[i]; ++i)
-        s += p[i];
-    return s;
+    const char *c = const_cast<const char *>(p);
+    return std::string(c, strnlen(c, n));
 }
 
 // An ICY stream on loopback: an mp3 looped at 128 kbit/s (after a 2 s
 // burst), with a metadata block after every kMetaInt bytes when asked for,
 // its stream title changing after 5 s.
-class IcyServer {
-public:
+struct IcyServer {
     static const int kMetaInt = 8000;
     ~IcyServer() { Stop(); }
     bool Start(const std::string &mp3, const std::vector<std::string> &titles)
@@ -126,10 +353,6 @@ public:
         if (thread_.joinable())
             thread_.join();
     }
-    std::string Url() const { return url_; }
-    bool AskedForMeta() const { return askedForMeta_; }
-
-private:
     httplib::Server server_;
     std::string url_;
     std::thread thread_;
@@ -179,10 +402,7 @@ protected:
         conn_ = accept4(listen_, nullptr, nullptr, SOCK_CLOEXEC);
         ASSERT_GE(conn_, 0);
     }
-    bool Send(const std::string &bytes)
-    {
-        return write(conn_, bytes.data(), bytes.size()) == ssize_t(bytes.size());
-    }
+    bool Send(const std::string &b) { return write(conn_, b.data(), b.size()) == ssize_t(b.size()); }
     std::string Uri() { return Text(seg_->currentUri, sizeof(seg_->currentUri)); }
     void ExpectPlaying(const std::string &uri, int duration)
     {
@@ -253,49 +473,7 @@ TEST_F(MplayerDaemonTest, PlaysEveryFormatBackToBackIntoOneWav)
     }
 }
 
-TEST_F(MplayerDaemonTest, GarbageOnTheCommandStreamIsSkipped)
-{
-    std::string song = Media("long.ogg");
-    ASSERT_TRUE(MakeTone(song, 440, 8));
-    StartConnected(song);
-    ExpectPlaying(song, 8);
-    ASSERT_TRUE(Send(std::string("\x01\x02junk 99 \xff\xfe", 13) + Padded("setvol 30") +
-                     "more junk!" + "pause"));
-    EXPECT_TRUE(WaitFor([&] { return seg_->state == PLAYER_STATE_PAUSED && seg_->value4104 == 30; }, 2000))
-        << "state " << seg_->state << " volume " << seg_->value4104;
-    ASSERT_TRUE(Send("quit"));
-    ExpectCleanExit();
-    EXPECT_NE(std::string::npos, h_.Log().find("not a command")) << h_.Log();
-}
-
-// SIGTERM and a closed connection both end the player cleanly, with a WAV
-// file whose sizes are final.
-TEST_F(MplayerDaemonTest, SigtermOrClosedConnectionCompletesTheWavFile)
-{
-    std::string song = Media("s.mp3");
-    ASSERT_TRUE(MakeTone(song, 440, 10));
-    for (bool bySignal : {true, false}) {
-        SCOPED_TRACE(bySignal ? "SIGTERM" : "closed connection");
-        memset(const_cast<PlayerStatusShm *>(seg_), 0, sizeof(PlayerStatusShm));
-        StartConnected(song);
-        ASSERT_TRUE(WaitFor([&] { return seg_->position >= 1; }, 5000));
-        SleepMs(500);
-        if (bySignal)
-            kill(pid_, SIGTERM);
-        close(conn_);
-        conn_ = -1;
-        ExpectCleanExit();
-        localplay::Wav w;
-        ASSERT_TRUE(localplay::LoadWav(wav_, &w));
-        EXPECT_TRUE(w.sizesFinal);
-        EXPECT_GT(w.Seconds(), 1.2);
-        EXPECT_LT(w.Seconds(), 4.0);
-        std::vector<localplay::Run> runs = localplay::ToneRuns(w, {440});
-        ASSERT_EQ(1u, runs.size());
-    }
-}
-
-TEST_F(MplayerDaemonTest, UnplayableSongIsReportedAsEnded)
+TEST_F(MplayerDaemonTest, UnplayableSongsAndGarbageAreSurvived)
 {
     std::string bad = Media("bad.mp3"), good = Media("good.flac");
     std::string noise(20000, '\0');
@@ -307,7 +485,7 @@ TEST_F(MplayerDaemonTest, UnplayableSongIsReportedAsEnded)
     ExpectEndAndAck(8000);
     EXPECT_EQ(bad, Uri());
     for (std::string uri : {Media("missing.mp3"), std::string("http://127.0.0.1:1/station")}) {
-        ASSERT_TRUE(Send(Load(uri)));
+        ASSERT_TRUE(Send(std::string("\x01\x02junk 99 \xff", 12) + Load(uri)));  // garbage skipped
         ExpectEndAndAck(8000);
     }
     ASSERT_TRUE(Send(Load(good)));
@@ -328,10 +506,10 @@ TEST_F(MplayerDaemonTest, RadioStationNameAndChangingStreamTitle)
     IcyServer server;
     const std::string second = "Second Song - Artist \xc3\xa9";
     ASSERT_TRUE(server.Start(h_.ReadFile("/media/tone.mp3"), {"First Song", second}));
-    StartConnected(server.Url(), 80);
+    StartConnected(server.url_, 80);
     auto station = [&] { return Text(seg_->radioStation, sizeof(seg_->radioStation)); };
     auto title = [&] { return Text(seg_->streamTitle, sizeof(seg_->streamTitle)); };
-    EXPECT_TRUE(WaitFor([&] { return Uri() == server.Url(); }, 2000)) << Uri();
+    EXPECT_TRUE(WaitFor([&] { return Uri() == server.url_; }, 2000)) << Uri();
     EXPECT_TRUE(WaitFor([&] { return station() == "Tarn Test Radio"; }, 10000)) << station();
     EXPECT_TRUE(WaitFor([&] { return title() == "First Song"; }, 10000)) << title();
     EXPECT_TRUE(WaitFor([&] { return seg_->position >= 1; }, 5000));
@@ -339,7 +517,7 @@ TEST_F(MplayerDaemonTest, RadioStationNameAndChangingStreamTitle)
     EXPECT_EQ(-1, seg_->duration);
     EXPECT_TRUE(WaitFor([&] { return title() == second; }, 15000)) << title();
     EXPECT_EQ("Tarn Test Radio", station());
-    EXPECT_TRUE(server.AskedForMeta());
+    EXPECT_TRUE(server.askedForMeta_);
 
     // A seek on a live stream is refused without harm.
     ASSERT_TRUE(Send(Padded("seek 30")));

@@ -2,15 +2,11 @@
 // test itself: good answers, garbage, errors, oversized, slow and no answers.
 #include <gtest/gtest.h>
 
-#include <arpa/inet.h>
 #include <atomic>
 #include <chrono>
 #include <ctime>
-#include <netinet/in.h>
 #include <string>
-#include <sys/socket.h>
 #include <thread>
-#include <unistd.h>
 #include <utime.h>
 
 #include <httplib.h>
@@ -92,16 +88,14 @@ TEST_F(RadioFetchTest, GoodAnswerIsFetchedOnlyWhenADayOldOrForced)
     Json::Value list;
     ASSERT_EQ(0, RadioioListGet(list, false));
     EXPECT_EQ("/good/json/stations/topclick/100?hidebroken=true", lastTarget);
-    ASSERT_EQ(3u, list["stations"].size());
-    EXPECT_EQ(3, list["total"].asInt());
-    const Json::Value &s0 = list["stations"][0];
-    EXPECT_EQ("Resolved FM", s0["name"].asString());
-    EXPECT_EQ("http://stream/resolved", s0["url"].asString());
-    EXPECT_EQ("jazz,swing", s0["desc"].asString());
-    EXPECT_EQ(128000, s0["bitrate"].asInt());
-    EXPECT_EQ("http://stream/plain", list["stations"][1]["url"].asString());
-    EXPECT_EQ(96000, list["stations"][1]["bitrate"].asInt());
-    EXPECT_EQ("Zero Rate", list["stations"][2]["name"].asString());
+    // Stations without a URL or name, or not objects, are left out; names
+    // trimmed; the resolved URL wins; kbit/s become bit/s; tags the desc.
+    std::string got = std::to_string(list["total"].asInt());
+    for (const Json::Value &st : list["stations"])
+        got += "|" + st["name"].asString() + ";" + st["url"].asString() + ";" + st["desc"].asString() + ";" +
+               std::to_string(st["bitrate"].asInt());
+    EXPECT_EQ("3|Resolved FM;http://stream/resolved;jazz,swing;128000|Plain URL;http://stream/plain;;96000|"
+              "Zero Rate;http://stream/zero;;0", got);
     Json::Value file;  // the file keeps kilobits per second as text
     ASSERT_TRUE(Json::Reader().parse(h.ReadFile(kRadioio), file));
     EXPECT_EQ("128", file["stations"][0]["bitrate"].asString());
@@ -125,41 +119,21 @@ TEST_F(RadioFetchTest, GoodAnswerIsFetchedOnlyWhenADayOldOrForced)
 
 TEST_F(RadioFetchTest, FailedFetchesWriteNothing)
 {
-    struct Case { const char *kind, *log; } cases[] = {
-        {"garbage", "is not a station list"}, {"object", "is not a station list"},
-        {"error", "HTTP status 500"}, {"big", "is larger than"}, {"slow", "Failed to fetch"}};
+    // "slow" answers after 3 s, like a server that accepts and never answers:
+    // the 1 s limit ends the wait. Nothing listens on port 1.
+    struct Case { std::string url; const char *log; } cases[] = {
+        {base + "garbage", "is not a station list"}, {base + "object", "is not a station list"},
+        {base + "error", "HTTP status 500"}, {base + "big", "is larger than"},
+        {base + "slow", "Failed to fetch"}, {"http://127.0.0.1:1", "Failed to fetch"}};
     for (const Case &c : cases) {
-        SCOPED_TRACE(c.kind);
-        UseDirectory(base + c.kind);
+        SCOPED_TRACE(c.url);
+        UseDirectory(c.url);
         h.ClearLog();
         auto start = std::chrono::steady_clock::now();
         EXPECT_EQ(-1, MediaServer::RadioUpdateRadioio());
         EXPECT_LT(std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count(), 2.9);
         EXPECT_EQ(1, h.CountLog(c.log)) << h.Log();
         EXPECT_FALSE(h.Exists(kRadioio));
-    }
-
-    // A listener that never accepts: the time-out ends the wait. Then
-    // nothing listens: refused at once.
-    int fd = socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in addr = {};
-    addr.sin_family = AF_INET;
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t len = sizeof(addr);
-    ASSERT_EQ(0, bind(fd, (sockaddr *)&addr, sizeof(addr)));
-    ASSERT_EQ(0, listen(fd, 4));
-    ASSERT_EQ(0, getsockname(fd, (sockaddr *)&addr, &len));
-    UseDirectory("http://127.0.0.1:" + std::to_string(ntohs(addr.sin_port)));
-    for (int round = 0; round < 2; ++round) {
-        h.ClearLog();
-        auto start = std::chrono::steady_clock::now();
-        EXPECT_EQ(-1, MediaServer::RadioUpdateRadioio());
-        double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-        EXPECT_LT(seconds, 5.0);
-        EXPECT_GE(seconds, round == 0 ? 0.5 : 0.0);
-        EXPECT_EQ(1, h.CountLog("Failed to fetch"));
-        if (round == 0)
-            close(fd);
     }
 
     // A stale list survives a failed refresh unchanged and is still read.

@@ -22,11 +22,9 @@ Json::Value MakeList(int n)
 {
     Json::Value list(Json::objectValue);
     for (int i = 0; i < n; i++) {
-        Json::Value s(Json::objectValue);
-        s["name"] = "station " + std::to_string(i);
-        s["url"] = "http://stream.example/" + std::to_string(i);
-        s["desc"] = std::string(40, 'd');
-        list["stations"].append(s);
+        list["stations"][i]["name"] = "station " + std::to_string(i);
+        list["stations"][i]["url"] = "http://stream.example/" + std::to_string(i);
+        list["stations"][i]["desc"] = std::string(40, 'd');
     }
     list["total"] = n;
     return list;
@@ -48,16 +46,13 @@ TEST(RadioListSaveFullDisk, FailedSaveLeavesTheOldList)
     const std::string before = h.ReadFile(TARN_RADIO_FAVORITE);
     ASSERT_EQ(Json::StyledWriter().write(small), before);
 
-    // Fill the file system (bounded: 1 MiB at most, then byte by byte).
+    // Fill the file system (bounded: 1 MiB at most, the rest byte by byte).
     int fd = open((dir + "/filler").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    ASSERT_GE(fd, 0);
-    char block[1024];
-    memset(block, 'f', sizeof(block));
-    for (int i = 0; i < 1024 && write(fd, block, sizeof(block)) > 0; i++) {
-    }
-    for (int i = 0; i < 4096 && write(fd, block, 1) == 1; i++) {
-    }
-    close(fd);
+    char block[1024] = {0};
+    for (int i = 0; fd >= 0 && i < 1024 + 4096; i++)
+        if (write(fd, block, i < 1024 ? sizeof(block) : 1) <= 0 && i >= 1024)
+            break;
+    ASSERT_EQ(0, close(fd));
 
     h.ClearLog();
     EXPECT_EQ(-1, RadioListSave(path.c_str(), big));
