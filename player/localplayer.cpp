@@ -7,6 +7,7 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <climits>
 #include <cstring>
 #include <sys/select.h>
 #include <sys/socket.h>
@@ -411,9 +412,15 @@ int LocalPlayer::Seek(const char *text)
     long target = strtol(text, nullptr, 10);
     if (target < 0)
         target = 0;
+    if (target > INT_MAX)
+        target = INT_MAX;
     // mplayer-daemon takes the offset from where it last reported to be.
+    // The difference is taken in 64 bits: a huge target must not overflow.
+    long long offset = static_cast<long long>(target) - position;
+    if (offset > INT_MAX)
+        offset = INT_MAX;
     char cmd[64];
-    snprintf(cmd, sizeof(cmd), "seek %d", static_cast<int>(target - position));
+    snprintf(cmd, sizeof(cmd), "seek %d", static_cast<int>(offset));
     if (SendPadded(cmd) != 0) {
         TLOG("Failed to send action play.");
         return -1;

@@ -5,6 +5,8 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <algorithm>
+#include <climits>
 #include <cstring>
 
 #include "platform/media_id.h"
@@ -406,11 +408,13 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
         break;
     }
     case ACT_VOLUME_UP:
-        controller->SetVolume(volume + 3);
+    case ACT_VOLUME_DOWN: {
+        // Not clamped to 0..100, but a renderer reporting an absurd volume
+        // must not make the step overflow.
+        long long v = static_cast<long long>(volume) + (code == ACT_VOLUME_UP ? 3 : -3);
+        controller->SetVolume(static_cast<int>(std::max<long long>(INT_MIN, std::min<long long>(INT_MAX, v))));
         break;
-    case ACT_VOLUME_DOWN:
-        controller->SetVolume(volume - 3);
-        break;
+    }
     case ACT_GET_STATUS:
         result = GetStatusJson(reply);
         break;

@@ -50,13 +50,15 @@ if [ "$QUICK" = "0" ]; then
     rm -f build-asan/sanitizer.*
     export ASAN_OPTIONS="${ASAN_OPTIONS:-detect_leaks=1}:log_path=$(pwd)/build-asan/sanitizer"
     export UBSAN_OPTIONS="${UBSAN_OPTIONS:-print_stacktrace=1}:log_path=$(pwd)/build-asan/sanitizer"
+    # Leaks inside GLib/GStreamer, libav and libupnp are the libraries' own.
+    export LSAN_OPTIONS="${LSAN_OPTIONS:-fast_unwind_on_malloc=0}:suppressions=$(pwd)/scripts/lsan.supp"
     build_and_test build-asan asan -DTARN_SANITIZE=ON
     if ls build-asan/sanitizer.* > /dev/null 2>&1; then
         echo "asan: sanitizer reports:"
         for f in build-asan/sanitizer.*; do echo "--- $f"; head -60 "$f"; done
         failed="$failed asan-reports"
     fi
-    unset ASAN_OPTIONS UBSAN_OPTIONS
+    unset ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS
 
     # ThreadSanitizer: only the tests labelled "upnp" (the code with threads).
     stage "tsan: tests labelled upnp"
@@ -68,7 +70,7 @@ if [ "$QUICK" = "0" ]; then
         else
             targets=""
             for t in $tests; do targets="$targets ${t#*.}"; done
-            if cmake --build build-tsan -j"$JOBS" --target tarnaudiod $targets; then
+            if cmake --build build-tsan -j"$JOBS" --target tarnaudiod tarnweb mplayer-daemon $targets; then
                 (cd build-tsan && TSAN_OPTIONS=${TSAN_OPTIONS:-halt_on_error=1} \
                     ctest --output-on-failure -j"$JOBS" -L upnp) || failed="$failed tsan-ctest"
             else
