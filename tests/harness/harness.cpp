@@ -25,7 +25,13 @@ namespace tarntest {
 
 namespace {
 
-std::string g_processRoot;
+// A function-local static: test files create a Harness during their own static
+// initialisation, which may run before this file's.
+std::string &ProcessRoot()
+{
+    static std::string root;
+    return root;
+}
 
 long NowMs()
 {
@@ -50,8 +56,8 @@ void EmptyDir(const std::string &dir)
 void RemoveProcessRoot()
 {
     std::error_code ec;
-    if (!g_processRoot.empty())
-        std::filesystem::remove_all(g_processRoot, ec);
+    if (!ProcessRoot().empty())
+        std::filesystem::remove_all(ProcessRoot(), ec);
 }
 
 int MakeDirs(const std::string &path)
@@ -151,24 +157,24 @@ Harness::Harness(bool freshSegments)
     // A daemon that closes a connection early must fail a write, not end
     // the test program.
     signal(SIGPIPE, SIG_IGN);
-    if (g_processRoot.empty()) {
+    if (ProcessRoot().empty()) {
         char tmpl[] = "/tmp/tarnroot.XXXXXX";
         if (!mkdtemp(tmpl)) {
             error = std::string("mkdtemp failed: ") + strerror(errno);
             return;
         }
-        g_processRoot = tmpl;
+        ProcessRoot() = tmpl;
         atexit(RemoveProcessRoot);
         char key[32];
         // Distinct per test process; keys stay clear of the appliance's own.
         snprintf(key, sizeof(key), "%d", 0x30000000 + (static_cast<int>(getpid()) % 0x100000) * 4);
-        setenv("TARN_ROOT", g_processRoot.c_str(), 1);
+        setenv("TARN_ROOT", ProcessRoot().c_str(), 1);
         setenv("TARN_SHM_KEY", key, 1);
-        setenv("TARN_LOG_FILE", (g_processRoot + "/log.txt").c_str(), 1);
+        setenv("TARN_LOG_FILE", (ProcessRoot() + "/log.txt").c_str(), 1);
         if (TarnEnvGet("TARN_AUDIO_OUT").empty())
             setenv("TARN_AUDIO_OUT", "null", 1);
     }
-    root = g_processRoot;
+    root = ProcessRoot();
     if (TarnRoot() != root)
         error = "TARN_ROOT was read before the harness set it";
     PrepareRoot();
