@@ -51,11 +51,12 @@ if [ "$QUICK" = "0" ]; then
     export ASAN_OPTIONS="${ASAN_OPTIONS:-detect_leaks=1}:log_path=$(pwd)/build-asan/sanitizer"
     export UBSAN_OPTIONS="${UBSAN_OPTIONS:-print_stacktrace=1}:log_path=$(pwd)/build-asan/sanitizer"
     # Leaks inside GLib/GStreamer, libav and libupnp are the libraries' own.
-    export LSAN_OPTIONS="${LSAN_OPTIONS:-fast_unwind_on_malloc=0}:suppressions=$(pwd)/scripts/lsan.supp"
+    export LSAN_OPTIONS="${LSAN_OPTIONS:-fast_unwind_on_malloc=0}:print_suppressions=0:suppressions=$(pwd)/scripts/lsan.supp"
     build_and_test build-asan asan -DTARN_SANITIZE=ON
-    if ls build-asan/sanitizer.* > /dev/null 2>&1; then
+    reports=$(grep -l -E "ERROR: |runtime error" build-asan/sanitizer.* 2>/dev/null)
+    if [ -n "$reports" ]; then
         echo "asan: sanitizer reports:"
-        for f in build-asan/sanitizer.*; do echo "--- $f"; head -60 "$f"; done
+        for f in $reports; do echo "--- $f"; head -60 "$f"; done
         failed="$failed asan-reports"
     fi
     unset ASAN_OPTIONS UBSAN_OPTIONS LSAN_OPTIONS
