@@ -22,7 +22,6 @@ static const char kLogUnit[] = "tarnweb";
 
 namespace {
 
-const char kSongPrefix[] = "/audio/webUI/audiotransfer.cgi/";
 const size_t kChunk = 64 * 1024;
 const size_t kMaxRanges = 8;
 // DLNA: streaming transfer, background transfer, connection stalling, DLNA 1.5.
