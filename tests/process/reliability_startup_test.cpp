@@ -82,8 +82,9 @@ TEST_F(StartupFaults, SigtermAtManyPointsOfStartUp)
             bool ok = (WIFEXITED(r.second) && WEXITSTATUS(r.second) == 0) ||
                       (r.first == launcher && WIFSIGNALED(r.second) && WTERMSIG(r.second) == SIGTERM);
             EXPECT_TRUE(ok) << "pid " << r.first << " status " << r.second;
-            if (r.first != launcher)
+            if (r.first != launcher) {
                 EXPECT_FALSE(WIFSIGNALED(r.second)) << "the daemon died of signal " << WTERMSIG(r.second);
+            }
         }
         printf("delay %6d us: SIGTERM to the %s, %zu process(es) ended, exit logged %d time(s)\n",
                delay, target == launcher ? "launcher" : "daemon", h.Reaped().size() - before.size(),
@@ -172,8 +173,9 @@ TEST_F(StartupFaults, RestartMeetsSmallerSegment)
     EXPECT_EQ(0, h.Launch(&out));
     ASSERT_EQ(0, h.WaitAllChildren(15000));
     for (const auto &r : h.Reaped()) {
-        if (before.count(r.first) == 0)
+        if (before.count(r.first) == 0) {
             EXPECT_TRUE(WIFEXITED(r.second) && WEXITSTATUS(r.second) == 0) << r.first << " " << r.second;
+        }
     }
     EXPECT_TRUE(h.WaitLog("Failed to create shared memory"));
     EXPECT_EQ(1, h.CountLog(kExit));

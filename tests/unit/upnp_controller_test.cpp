@@ -99,8 +99,9 @@ TEST(UpnpUrl, LocationHostPortAndServiceUrls)
     for (const auto &k : cases) {
         std::string ip, port;
         ASSERT_EQ(k.rc, UpnpController::ParseHttpUrl(k.url, ip, port)) << k.url;
-        if (k.rc == 0)
+        if (k.rc == 0) {
             EXPECT_EQ(std::string(k.ip) + " " + k.port, ip + " " + port) << k.url;
+        }
     }
     EXPECT_EQ("http://10.0.0.5:80/ctl/x", UpnpController::ResolveUrl("http://10.0.0.5:80", "/ctl/x"));
     EXPECT_EQ("http://10.0.0.5:80/ctl/x", UpnpController::ResolveUrl("http://10.0.0.5:80", "ctl/x"));
@@ -157,8 +158,9 @@ TEST(UpnpRenderers, UrlsNoDuplicatesAndListReply)
         EXPECT_EQ(k.size, reply["list"].size()) << k.start << " " << k.limit;
         EXPECT_EQ(k.replyLimit, reply["limit"].asInt());
         EXPECT_EQ(3u, reply["total"].asUInt());
-        if (k.first >= 0)
+        if (k.first >= 0) {
             EXPECT_EQ(k.first, reply["list"][0]["index"].asInt());
+        }
     }
     Json::Value reply;
     c.GetRendererList(reply, 0, 0);
