@@ -10,6 +10,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include "daemon/socket.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 
@@ -18,35 +19,10 @@ static const char kInfoUnit[] = "info";
 
 namespace {
 
-long long NowUs()
-{
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return ts.tv_sec * 1000000LL + ts.tv_nsec / 1000;
-}
-
-// Waits at most 0.5 s for fd to become readable; a signal does not cut the
-// wait short. 1 readable, 0 not.
+// Waits at most 0.5 s for the reply; a signal does not cut the wait short.
 int WaitReadable(int fd)
 {
-    if (fd >= FD_SETSIZE)
-        return 0;
-    long long end = NowUs() + 500000;
-    for (;;) {
-        long long left = end - NowUs();
-        if (left < 0)
-            left = 0;
-        fd_set readSet;
-        FD_ZERO(&readSet);
-        FD_SET(fd, &readSet);
-        struct timeval tv = {static_cast<time_t>(left / 1000000),
-                             static_cast<suseconds_t>(left % 1000000)};
-        int r = select(fd + 1, &readSet, nullptr, nullptr, &tv);
-        if (r > 0)
-            return FD_ISSET(fd, &readSet) ? 1 : 0;
-        if (r == 0 || errno != EINTR || left == 0)
-            return 0;
-    }
+    return SocketWaitReady(fd, false, 500000);
 }
 
 // A request with the action and, when format is given, the parameter text.

@@ -1,7 +1,9 @@
 #include "daemon/socket.h"
 
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <sys/select.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -55,4 +57,32 @@ int SocketAcceptPoll(int fd)
         return client;
     }
     return -1;
+}
+
+int SocketWaitReady(int fd, bool forWrite, long long timeoutUs)
+{
+    if (fd < 0 || fd >= FD_SETSIZE)
+        return 0;
+    auto nowUs = [] {
+        struct timespec ts;
+        clock_gettime(CLOCK_MONOTONIC, &ts);
+        return ts.tv_sec * 1000000LL + ts.tv_nsec / 1000;
+    };
+    long long end = nowUs() + timeoutUs;
+    for (;;) {
+        long long left = end - nowUs();
+        if (left < 0)
+            left = 0;
+        fd_set set;
+        FD_ZERO(&set);
+        FD_SET(fd, &set);
+        struct timeval tv = {static_cast<time_t>(left / 1000000),
+                             static_cast<suseconds_t>(left % 1000000)};
+        int r = forWrite ? select(fd + 1, nullptr, &set, nullptr, &tv)
+                         : select(fd + 1, &set, nullptr, nullptr, &tv);
+        if (r > 0)
+            return FD_ISSET(fd, &set) ? 1 : 0;
+        if (r == 0 || errno != EINTR || left == 0)
+            return 0;
+    }
 }

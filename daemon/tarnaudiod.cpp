@@ -30,38 +30,9 @@ namespace {
 // reply.
 const long long kWaitUs = 500000;
 
-long long NowUs()
-{
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return ts.tv_sec * 1000000LL + ts.tv_nsec / 1000;
-}
-
-// Waits at most 0.5 s for fd to become readable (or writable). A signal that
-// interrupts select (SIGTERM arriving while a client is being served) does
-// not end the wait early: it goes on for the time that is left, so that the
-// request in flight is still answered. 1 ready, 0 not ready or error.
 int WaitFd(int fd, bool forWrite)
 {
-    if (fd < 0 || fd >= FD_SETSIZE)
-        return 0;
-    long long end = NowUs() + kWaitUs;
-    for (;;) {
-        long long left = end - NowUs();
-        if (left < 0)
-            left = 0;
-        fd_set set;
-        FD_ZERO(&set);
-        FD_SET(fd, &set);
-        struct timeval tv = {static_cast<time_t>(left / 1000000),
-                             static_cast<suseconds_t>(left % 1000000)};
-        int r = forWrite ? select(fd + 1, nullptr, &set, nullptr, &tv)
-                         : select(fd + 1, &set, nullptr, nullptr, &tv);
-        if (r > 0)
-            return FD_ISSET(fd, &set) ? 1 : 0;
-        if (r == 0 || errno != EINTR || left == 0)
-            return 0;
-    }
+    return SocketWaitReady(fd, forWrite, kWaitUs);
 }
 
 // The request as read, followed by a NUL so that a parameter text without

@@ -354,12 +354,9 @@ int MediaLibPathById(uint32_t id, char *path, size_t size)
 {
     if (!path || size == 0)
         return -1;
-    MediaLib lib;
-    if (!OpenLibrary(lib))
-        return -1;
-    MediaSong song;
-    int rc = lib.FindById(id, &song);
+    TARN_MEDIA_INFO info;
+    int rc = MediaLibFindById(id, &info);
     if (rc == 1)
-        snprintf(path, size, "%s", song.path.c_str());
+        snprintf(path, size, "%s", info.path);
     return rc;
 }
