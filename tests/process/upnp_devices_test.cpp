@@ -1,9 +1,6 @@
-// The real daemon in the test's network namespace, with real UPnP devices
-// (gmediarender, minidlna): list replies, capabilities from their service
-// descriptions, an action and its effect, removal of a renderer that vanished
-// without a bye-bye and of a server by bye-bye; and against misbehaving devices: malformed, huge,
-// deeply nested, endless descriptions, service descriptions that never finish,
-// bad LastChange events, garbage on the SSDP and GENA ports.
+// The real daemon with real UPnP devices (gmediarender, minidlna): lists,
+// capabilities, an action, removal by failure and by bye-bye; and against
+// misbehaving devices: bad descriptions and events, garbage on its ports.
 #include <gtest/gtest.h>
 
 #include <json/json.h>
@@ -52,8 +49,7 @@ protected:
         if (!tarntest::InPrivateNetns())
             GTEST_SKIP() << "needs a private network namespace (run under scripts/netns-run)";
         ASSERT_EQ(0, h.Start()) << h.Error();
-        // Devices go on the veth end the daemon's libupnp (HTTP on 49152) did
-        // not take, so that SSDP crosses the pair.
+        // Devices go on the veth end the daemon's libupnp did not take.
         daemonIp = fakedev::ListeningAddress(49152);
         ASSERT_FALSE(daemonIp.empty());
         fakedev::PeerInterface(daemonIp, deviceIp, deviceIface);
@@ -90,9 +86,8 @@ protected:
                         "Test Renderer", "-u", std::string(kRendererUdn + 5), "--gstout-audiopipe",
                         "fakesink sync=true"});
     }
-    // minidlna's own announcements do not reach the daemon here, but it answers
-    // searches on its interface: the daemon's searches leave through tveth0, the
-    // namespace's multicast route, so minidlna runs there and is found by a search.
+    // minidlna's announcements do not reach the daemon, but it answers searches,
+    // which leave through tveth0 (the multicast route): so it runs there.
     pid_t StartServer()
     {
         std::string dir = h.Root() + "/minidlna";

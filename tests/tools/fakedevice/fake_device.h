@@ -1,8 +1,6 @@
-// A scriptable UPnP device for the control point's tests: a small HTTP server
-// (descriptions, service descriptions, GENA subscriptions) whose
-// answers can also stall, never end, be cut off or be garbage, plus senders for
-// SSDP announcements and GENA events. Header only. It talks only to the
-// addresses the test gives it (loopback or the test namespace's veth pair).
+// A scriptable UPnP device for the control point's tests: an HTTP server whose
+// answers can also stall, never end, be cut off or be garbage, and senders for
+// SSDP announcements and GENA events, to the addresses the test gives only.
 #ifndef TARN_TEST_FAKE_DEVICE_H
 #define TARN_TEST_FAKE_DEVICE_H
 
@@ -30,7 +28,7 @@ struct Request {
     std::string method, path, head, body;
     std::string issuedSid;  // SUBSCRIBE: the subscription ID this server answered with
 
-    // Value of a header (name without regard to case), "" if absent.
+    // A header's value (name in any case), "" if absent.
     std::string Header(const char *name) const
     {
         size_t n = strlen(name);
@@ -69,10 +67,7 @@ inline bool SendAll(int fd, const std::string &text)
 
 class FakeHttpServer {
 public:
-    FakeHttpServer() = default;
     ~FakeHttpServer() { Stop(); }
-    FakeHttpServer(const FakeHttpServer &) = delete;
-    FakeHttpServer &operator=(const FakeHttpServer &) = delete;
 
     // Listens on ip, any free port. Returns the port, or -1.
     int Start(const char *ip)
@@ -114,7 +109,6 @@ public:
         std::lock_guard<std::mutex> lock(mutex);
         routes[path] = route;
     }
-    // Requests whose method (and path, when given) match.
     std::vector<Request> RequestsOf(const char *method, const char *path = nullptr)
     {
         std::lock_guard<std::mutex> lock(mutex);
@@ -124,7 +118,6 @@ public:
                 out.push_back(r);
         return out;
     }
-    // Waits until at least count requests match; false on time-out.
     bool WaitFor(const char *method, const char *path, size_t count, int timeoutMs)
     {
         for (int waited = 0; RequestsOf(method, path).size() < count; waited += 20) {
@@ -136,8 +129,7 @@ public:
     }
 
 private:
-    // Reads the headers and the announced body; false when the peer goes away
-    // first, the server stops or 10 s pass.
+    // Headers and body; false when the peer goes, the server stops or 10 s pass.
     bool ReadRequest(int fd, Request &req)
     {
         std::string data;
@@ -220,9 +212,8 @@ private:
     std::vector<Request> requests;
 };
 
-// Sends bytes over UDP (multicast: out of the interface holding fromIp, looped
-// back to this host) or TCP from fromIp to ip:port. For TCP returns the status
-// of the HTTP answer (-1 for none); for UDP 0 when sent, else -1.
+// Sends bytes by UDP (multicast out of fromIp's interface, looped back) or TCP
+// from fromIp to ip:port: TCP gives the HTTP answer's status or -1, UDP 0 or -1.
 inline int SendRaw(int type, const std::string &fromIp, const std::string &ip, int port, const std::string &bytes)
 {
     int fd = socket(AF_INET, type | SOCK_CLOEXEC, 0), status = -1;
@@ -249,8 +240,7 @@ inline int SendRaw(int type, const std::string &fromIp, const std::string &ip, i
     return status;
 }
 
-// Announces (alive) or withdraws (bye-bye) a device's service by one SSDP
-// NOTIFY; the USN is "<udn>::<service type>". Returns 0 or -1.
+// One SSDP NOTIFY (alive or bye-bye) for "<udn>::<service type>"; 0 or -1.
 inline int AnnounceService(const std::string &fromIp, bool alive, const std::string &udn,
                            const std::string &serviceType, const std::string &location)
 {
@@ -263,8 +253,7 @@ inline int AnnounceService(const std::string &fromIp, bool alive, const std::str
                        "\r\nUSN: " + udn + "::" + serviceType + "\r\n\r\n");
 }
 
-// Sends one GENA NOTIFY carrying body to a subscriber's CALLBACK URL
-// ("<http://ip:port/path>") and returns the HTTP status of its answer, or -1.
+// One GENA NOTIFY to a CALLBACK ("<http://ip:port/path>"): the answer's status or -1.
 inline int SendGenaEvent(const std::string &callback, const std::string &sid, int seq, const std::string &body)
 {
     size_t colon = callback.find(':', 8), slash = callback.find('/', 8);
@@ -288,9 +277,8 @@ inline std::string LastChangeEvent(const std::string &lastChange)
            "</LastChange></e:property></e:propertyset>";
 }
 
-// The IPv4 address on which some process of this network namespace listens on
-// a TCP port ("" when none): libupnp's HTTP server shows which address a
-// control point chose.
+// The IPv4 address some process here listens on at a TCP port ("" when none):
+// libupnp's HTTP server shows which address a control point chose.
 inline std::string ListeningAddress(int port)
 {
     FILE *f = fopen("/proc/net/tcp", "r");
@@ -306,8 +294,7 @@ inline std::string ListeningAddress(int port)
     return text;
 }
 
-// The namespace's two veth ends (scripts/netns-run): the one a control point at
-// controlPointIp is not on, so that announcements cross the pair.
+// The veth end (scripts/netns-run) a control point at controlPointIp is not on.
 inline void PeerInterface(const std::string &controlPointIp, std::string &ip, std::string &iface)
 {
     bool first = controlPointIp == "10.77.0.1";
@@ -315,8 +302,7 @@ inline void PeerInterface(const std::string &controlPointIp, std::string &ip, st
     iface = first ? "tveth1" : "tveth0";
 }
 
-// A renderer description with the given services (type, base name) whose URLs
-// are /<name>/scpd.xml, /<name>/control and /<name>/event.
+// A renderer description; each service (type, name) at /<name>/scpd.xml, control, event.
 inline std::string DeviceDescription(const std::string &udn, const std::string &name,
                                      const std::vector<std::pair<std::string, std::string>> &services)
 {
@@ -330,8 +316,7 @@ inline std::string DeviceDescription(const std::string &udn, const std::string &
     return xml + "</serviceList></device></root>\n";
 }
 
-// The smallest service descriptions the capability probe accepts: AVTransport
-// with Seek by REL_TIME, RenderingControl with SetVolume.
+// The smallest service descriptions the capability probe accepts.
 inline std::string AvtScpd()
 {
     return "<scpd><actionList><action><name>Seek</name></action></actionList><serviceStateTable>"
