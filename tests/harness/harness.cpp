@@ -40,10 +40,7 @@ long NowMs()
     return ts.tv_sec * 1000L + ts.tv_nsec / 1000000L;
 }
 
-void SleepMs(int ms)
-{
-    usleep(static_cast<useconds_t>(ms) * 1000);
-}
+void SleepMs(int ms) { usleep(static_cast<useconds_t>(ms) * 1000); }
 
 // Empties a directory tree (the directory itself stays).
 void EmptyDir(const std::string &dir)
@@ -56,8 +53,7 @@ void EmptyDir(const std::string &dir)
 void RemoveProcessRoot()
 {
     std::error_code ec;
-    if (!ProcessRoot().empty())
-        std::filesystem::remove_all(ProcessRoot(), ec);
+    std::filesystem::remove_all(ProcessRoot(), ec);
 }
 
 int MakeDirs(const std::string &path)
@@ -73,12 +69,7 @@ std::string ReadAll(const std::string &path)
     return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
-void RemoveSegment(int key)
-{
-    int id = shmget(key, 0, 0);
-    if (id >= 0)
-        shmctl(id, IPC_RMID, nullptr);
-}
+void RemoveSegment(int key) { shmctl(shmget(key, 0, 0), IPC_RMID, nullptr); }
 
 void *AttachSegment(int key, size_t size, bool readOnly)
 {
@@ -149,8 +140,6 @@ int CountFds(pid_t pid)
     return ec ? -1 : static_cast<int>(std::distance(it, {}));
 }
 
-// ---------------------------------------------------------------------------
-
 Harness::Harness(bool freshSegments)
 {
     prctl(PR_SET_CHILD_SUBREAPER, 1, 0, 0, 0);
@@ -218,10 +207,7 @@ int Harness::WriteFile(const char *fixedPath, const std::string &content) const
     return out ? 0 : -1;
 }
 
-std::string Harness::ReadFile(const char *fixedPath) const
-{
-    return ReadAll(Path(fixedPath));
-}
+std::string Harness::ReadFile(const char *fixedPath) const { return ReadAll(Path(fixedPath)); }
 
 bool Harness::Exists(const char *fixedPath) const
 {
@@ -328,10 +314,7 @@ int Harness::Run(const std::vector<std::string> &argv, std::string *out, int tim
     return rc == -2 ? -1 : rc;
 }
 
-int Harness::PidFromFile() const
-{
-    return TLIBCReadPidFile(Path(TARN_PID_FILE).c_str());
-}
+int Harness::PidFromFile() const { return TLIBCReadPidFile(Path(TARN_PID_FILE).c_str()); }
 
 int Harness::Start(int timeoutMs)
 {
@@ -441,10 +424,7 @@ int Harness::QueueInsert(const TARN_MEDIA_INFO &info, int position)
 
 // ---- log ---------------------------------------------------------------------
 
-std::string Harness::Log() const
-{
-    return ReadAll(root + "/log.txt");
-}
+std::string Harness::Log() const { return ReadAll(root + "/log.txt"); }
 
 int Harness::CountLog(const std::string &needle) const
 {
@@ -463,10 +443,7 @@ bool Harness::WaitLog(const std::string &needle, int timeoutMs) const
     return true;
 }
 
-void Harness::ClearLog() const
-{
-    truncate((root + "/log.txt").c_str(), 0);
-}
+void Harness::ClearLog() const { truncate((root + "/log.txt").c_str(), 0); }
 
 // ---- segments ----------------------------------------------------------------
 

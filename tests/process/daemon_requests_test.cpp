@@ -1,20 +1,15 @@
-// The control protocol against the real daemon: hostile clients, selection,
-// the changed flag, queue records, every client call and tarnctl.
+// The control protocol against the real daemon: malformed requests, queue
+// records and cut replies.
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <chrono>
 #include <cstring>
 #include <poll.h>
 #include <string>
-#include <thread>
 #include <unistd.h>
-#include <vector>
 
 #include <json/json.h>
 
-#include "daemon/ctrl.h"
-#include "daemon/socket.h"
 #include "daemon/tarn_types.h"
 #include "tests/harness/harness.h"
 
@@ -46,7 +41,6 @@ std::string Drain(int fd, int waitMs)
 class RequestsTest : public ::testing::Test {
 protected:
     tarntest::Harness h;
-    std::string tarnctl = tarntest::BinPath("tarnctl");
     void SetUp() override { ASSERT_EQ(0, h.Start()) << h.Error(); }
     void TearDown() override { EXPECT_EQ(0, h.Stop()); }
 
@@ -119,70 +113,6 @@ TEST_F(RequestsTest, MalformedRequestsGetNoReplyAndTheDaemonGoesOn)
     EXPECT_EQ(fdsBefore, tarntest::CountFds(pid));
 }
 
-TEST_F(RequestsTest, ClientsThatNeverReadOrCrowdTheBacklog)
-{
-    pid_t pid = h.Pid();
-    int fdsBefore = tarntest::CountFds(pid);
-    std::vector<int> lazy;  // send a request, never read the reply
-    for (int i = 0; i < 8; ++i) {
-        int fd = h.Connect();
-        ASSERT_GE(fd, 0);
-        ControlRequest req = tarntest::MakeRequest(ACT_QUEUE_LIST, "0 10");
-        ASSERT_EQ(static_cast<ssize_t>(sizeof(req)), write(fd, &req, sizeof(req)));
-        lazy.push_back(fd);
-    }
-    // Many more clients at once than the backlog of 5: each is answered in turn.
-    const int kClients = 24;
-    std::atomic<int> answered{0};
-    std::vector<std::thread> threads;
-    for (int i = 0; i < kClients; ++i) {
-        threads.emplace_back([&] {
-            int fd = h.Connect();
-            ControlRequest req = tarntest::MakeRequest(ACT_GET_STATUS);
-            if (fd >= 0 && write(fd, &req, sizeof(req)) == static_cast<ssize_t>(sizeof(req)) &&
-                Drain(fd, 20000).size() == CTRL_REPLY_SIZE)
-                ++answered;
-            close(fd);
-        });
-    }
-    for (std::thread &t : threads)
-        t.join();
-    EXPECT_EQ(kClients, answered.load());
-    for (int fd : lazy)
-        close(fd);
-    EXPECT_TRUE(StillAnswers());
-    EXPECT_EQ(fdsBefore, tarntest::CountFds(pid));
-}
-
-TEST_F(RequestsTest, ChangedFlagAndPlayerSelectionRules)
-{
-    std::string reply;
-    EXPECT_EQ(0, PublishedChanged(0));
-    ASSERT_EQ(0, h.Request(ACT_SET_CHANGED, nullptr, &reply));
-    EXPECT_EQ("null\n", reply);
-    EXPECT_EQ(1, PublishedChanged(1));
-    ASSERT_EQ(0, h.Request(ACT_CLEAR_CHANGED));
-    EXPECT_EQ(0, PublishedChanged(0));
-    // A failing source change (no media library) leaves it alone.
-    ASSERT_EQ(0, h.Request(ACT_SOURCE_NEXT, nullptr, &reply));
-    EXPECT_EQ("null\n", reply);
-    usleep(50000);
-    EXPECT_EQ(0, PublishedChanged(0));
-
-    // Below -1 is logged; a renderer past the end is refused; -1 is local.
-    ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "-2", &reply));
-    EXPECT_EQ("null\n", reply);
-    EXPECT_EQ(1, h.CountLog("tarnaudiod:378 Bad player index [-2]"));
-    ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "3", &reply));
-    EXPECT_EQ("null\n", reply);
-    EXPECT_TRUE(StillAnswers());
-    ASSERT_EQ(0, h.Request(ACT_CYCLE_REPEAT_MODE));
-    EXPECT_EQ("Repeat One", Ask(ACT_QUEUE_LIST, "0 1")["mode"].asString());
-    EXPECT_EQ(0, h.CountLog("not handled"));
-    ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "-1"));
-    EXPECT_TRUE(StillAnswers());
-}
-
 TEST_F(RequestsTest, QueueRecordsInsertPositionAndCutReplies)
 {
     ASSERT_EQ(0, h.QueueAdd(tarntest::MakeMediaInfo("/music/a.mp3", "Alpha", "Ann")));
@@ -215,49 +145,6 @@ TEST_F(RequestsTest, QueueRecordsInsertPositionAndCutReplies)
     v = Ask(ACT_QUEUE_LIST, "20 3");
     EXPECT_EQ(23, v["total"].asInt());
     EXPECT_EQ(3u, v["uris"].size());
-}
-
-TEST_F(RequestsTest, EveryClientCallIsAnsweredByTheDaemon)
-{
-    for (int i = 0; i < 3; ++i)
-        ASSERT_EQ(0, h.QueueAdd(tarntest::MakeMediaInfo("/nonexistent/song" + std::to_string(i) + ".mp3")));
-    char buf[CTRL_REPLY_SIZE];
-    EXPECT_EQ(0, InfoListQueue(1, 1, buf, sizeof(buf)));
-    EXPECT_EQ("song1", Parse(buf)["uris"][0]["title"].asString());
-    EXPECT_EQ(0, InfoListServers(0, 5, buf, sizeof(buf)));
-    EXPECT_EQ(5, Parse(buf)["limit"].asInt());
-    EXPECT_EQ(0, InfoListRenderers(0, 5, buf, sizeof(buf)));
-    EXPECT_TRUE(Parse(buf).isMember("current"));
-    EXPECT_EQ(0, CtrlSetVolume(40));
-    EXPECT_EQ(0, InfoGetStatus(buf, sizeof(buf)));
-    EXPECT_EQ(40, Parse(buf)["Volume"].asInt());
-    const float gains[10] = {0, 1, 2, 3, 4, 5, 6, 7, 8, 9};
-    // Every other call answers, whether or not it can do anything here.
-    for (int rc : {CtrlSetChanged(), CtrlClearChanged(), CtrlVolumeUp(), CtrlVolumeDown(), CtrlMute(),
-                   CtrlPlayIndex(2), CtrlSeek(5), CtrlNext(), CtrlPrevious(), CtrlPlayPause(), CtrlStop(),
-                   CtrlSetEqualizer(gains), InfoSearchServers(), InfoSearchRenderers(), InfoSelectPlayer(-1),
-                   CtrlSourceRandom(), CtrlSourceRadio(), CtrlSourceIpod(), CtrlSourcePlaylist(),
-                   CtrlSourceCustom(1), CtrlSourceNext(), CtrlSourcePrevious(), CtrlSaveCustom(1)})
-        EXPECT_EQ(0, rc);
-    EXPECT_TRUE(StillAnswers());
-
-    std::string out;
-    ASSERT_EQ(0, h.Run({tarnctl, "status"}, &out)) << out;
-
-    // With the daemon gone the calls fail and tarnctl says how to start it.
-    EXPECT_EQ(0, h.Stop());
-    EXPECT_EQ(-1, CtrlStop());
-    EXPECT_EQ(-1, InfoGetStatus(buf, sizeof(buf)));
-    EXPECT_EQ(1, h.Run({tarnctl, "status"}, &out));
-    EXPECT_NE(std::string::npos, out.find("tarnaudiod is not running")) << out;
-    EXPECT_NE(std::string::npos, out.find("scripts/run.sh")) << out;
-    // Something listening that never answers is reported as such.
-    int fd = SocketListen(h.Path(TARN_CTRL_SOCKET).c_str(), 5);
-    ASSERT_GE(fd, 0);
-    EXPECT_EQ(1, h.Run({tarnctl, "--timeout", "300", "status"}, &out));
-    EXPECT_NE(std::string::npos, out.find("did not answer within 300 ms")) << out;
-    close(fd);
-    ASSERT_EQ(0, h.Start()) << h.Error();  // for TearDown
 }
 
 }  // namespace

@@ -1,6 +1,5 @@
 // The media library on real tagged files in a temporary root: scans and
-// rescans, damaged files and databases, saved M3U playlists, random
-// selections, smart playlists and custom slots as the daemon calls them.
+// rescans, damaged files, random selections and smart playlists.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -104,47 +103,6 @@ TEST_F(LibraryTest, IncrementalRescanAndDamagedFilesAreSkipped)
     EXPECT_EQ(0, lib.FindByPath(canon + "/a.mp3", &after));
 }
 
-TEST_F(LibraryTest, DamagedAndForeignDatabasesGiveClearErrors)
-{
-    std::string db = h.Root() + "/var/lib.db";
-    EXPECT_EQ(-1, lib.Open(db, false));
-    EXPECT_NE(std::string::npos, lib.LastError().find("tarnlib scan")) << lib.LastError();
-    WriteText(db, std::string(8192, 'x'));
-    EXPECT_EQ(-1, lib.Open(db, true));
-    EXPECT_NE(std::string::npos, lib.LastError().find("damaged")) << lib.LastError();
-    EXPECT_EQ(8192u, fs::file_size(db)) << "a damaged library is left as it was";
-}
-
-TEST_F(LibraryTest, SavedPlaylistsResolveRelativeAndSkipMissingSongs)
-{
-    Song("a/one.mp3", {"One", "Ann", "", "", 0, 1});
-    Song("a/two.flac", {"Two", "Ann", "", "", 0, 2});
-    Song("b/three.ogg", {"Three", "Bob", "", "", 0, 3});
-    std::string canon = fs::canonical(music).string();
-    WriteText(music + "/lists/mix.m3u", "#EXTM3U\n#PLAYLIST:Zebra Mix\n#EXTINF:1,Bob - Three\n../b/three.ogg\n"
-                                        "../a/gone.mp3\n\r\n" + canon + "/a/one.mp3\r\nfile://" + canon +
-                                        "/a/two%2Eflac\nhttp://radio.invalid/stream\n");
-    WriteText(music + "/lists/dead.m3u", "#EXTM3U\nnothing-here.mp3\n");
-    ASSERT_EQ(0, lib.Open(MediaLibDefaultPath(), true));
-    EXPECT_EQ(2, Scan(lib).playlists);
-    std::vector<TARN_PLAYLIST_INFO> all;
-    ASSERT_EQ(0, TARNPlaylistListAll(all, 0, 0, 0));
-    ASSERT_EQ(2u, all.size());
-    EXPECT_EQ("Zebra Mix", all[1].title);
-    std::vector<TARN_MEDIA_INFO> songs;
-    int count = -1;
-    ASSERT_EQ(0, ParsePlayListByFieldGivenPath(all[1].path.c_str(), &count, 0, 0, "*", 1, songs));
-    EXPECT_EQ(3, count);
-    EXPECT_EQ("Three,One,Two", Titles(songs));
-    EXPECT_NE(0u, songs[0].id);
-    EXPECT_STREQ((canon + "/b/three.ogg").c_str(), songs[0].path);
-    ASSERT_EQ(0, ParsePlayListByFieldGivenPath(all[1].path.c_str(), &count, 1, 1, "*", 1, songs));
-    EXPECT_EQ("One", Titles(songs));
-    // No playable song, no file: both "no playlist".
-    EXPECT_EQ(-1, ParsePlayListByFieldGivenPath(all[0].path.c_str(), &count, 0, 0, "*", 1, songs));
-    EXPECT_EQ(-1, ParsePlayListByFieldGivenPath((music + "/nope.m3u").c_str(), &count, 0, 0, "*", 1, songs));
-}
-
 TEST_F(LibraryTest, RandomSelectionOfOneHundredDistinctSongs)
 {
     for (int i = 0; i < 146; i++)
@@ -215,25 +173,6 @@ TEST_F(LibraryTest, SmartPlaylistsFollowTheirRules)
     std::string why;
     for (const char *bad : {"mood is happy", "genre like Jazz", "year is nineteen", "year from 1990", "genre is"})
         EXPECT_EQ(-1, SmartRuleParse(bad, &r, &why)) << bad;
-}
-
-TEST_F(LibraryTest, CustomSlotsRoundTripAndSurviveAFailedWrite)
-{
-    std::string file = TarnPath("/usr/tarn/etc/audio/custom_slots.json");
-    std::string type, second, third;
-    EXPECT_EQ(-1, TARNAudioCustomGet(1, type, second, third));
-    ASSERT_EQ(0, TARNAudioCustomSet(1, "playlist", "/music/a \"b\".m3u", "Title \xC3\xA9"));
-    ASSERT_EQ(0, TARNAudioCustomSet(2, "radio", "http://x.invalid/s", "Station"));
-    ASSERT_EQ(0, TARNAudioCustomGet(1, type, second, third));
-    EXPECT_EQ("playlist|/music/a \"b\".m3u|Title \xC3\xA9", type + "|" + second + "|" + third);
-    // A store that cannot write its temporary file leaves the old file whole.
-    std::string tmp = file + ".tmp." + std::to_string(getpid());
-    fs::create_directory(tmp);
-    EXPECT_EQ(-1, TARNAudioCustomSet(2, "radio", "http://y.invalid", "Other"));
-    fs::remove(tmp);
-    ASSERT_EQ(0, TARNAudioCustomGet(2, type, second, third));
-    EXPECT_EQ("http://x.invalid/s", second);
-    EXPECT_EQ(-1, TARNAudioCustomGet(3, type, second, third));
 }
 
 }  // namespace

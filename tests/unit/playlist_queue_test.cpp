@@ -1,13 +1,11 @@
-// The play queue: songs, current song, repeat modes, shuffle order; and the
-// shuffle's random sequence: an unseeded rand(), whatever other threads do
-// to the C library.
+// The play queue: songs, current song, repeat modes, shuffle order, list pages.
 #include <gtest/gtest.h>
 
+#include <climits>
 #include <cstdlib>
 #include <cstring>
 #include <numeric>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "player/playlist.h"
@@ -66,42 +64,6 @@ protected:
     tarntest::Harness h;
     Playlist p;
 };
-
-TEST_F(QueueTest, EmptyQueueAndOddRecords)
-{
-    std::string uri;
-    TARN_MEDIA_INFO s = Song(7), out;
-    Json::Value info;
-    EXPECT_EQ(-1, p.GetCurrentUri(uri));
-    EXPECT_EQ("-", Step(1, true));
-    EXPECT_EQ("-", Step(-1, false));
-    EXPECT_EQ(-1, p.GetCurrentInfoJson(info));
-    EXPECT_EQ(-1, p.SetCurrent(0));
-    EXPECT_EQ(-1, p.RemoveSong(0));
-    EXPECT_EQ(-1, p.InsertSong(0, &s));
-    EXPECT_EQ(-1, p.AddSong(nullptr));
-    // Entries are whole private copies.
-    memset(s.reserved4, 0x5a, sizeof(s.reserved4));
-    ASSERT_EQ(0, p.AddSong(&s));
-    TARN_MEDIA_INFO original = s;
-    snprintf(s.path, sizeof(s.path), "/changed.mp3");
-    ASSERT_EQ(0, p.GetCurrentSong(&out));
-    EXPECT_EQ(0, memcmp(&original, &out, sizeof(out)));
-    // Unterminated text stays inside its field.
-    memset(&s, 'A', sizeof(s));
-    memset(s.title, 'T', sizeof(s.title));
-    ASSERT_EQ(0, p.InsertSong(0, &s));
-    ASSERT_EQ(0, p.GetCurrentInfoJson(info));
-    EXPECT_EQ(std::string(sizeof(s.title), 'T'), info["title"].asString());
-    EXPECT_EQ(sizeof(s.path), info["path"].asString().size());
-    // A missing title falls back to the file name.
-    out.title[0] = '\0';
-    ASSERT_EQ(0, p.AddSong(&out));
-    ASSERT_EQ(0, p.SetCurrent(2));
-    ASSERT_EQ(0, p.GetCurrentInfoJson(info));
-    EXPECT_EQ("song7.mp3", info["title"].asString());
-    EXPECT_EQ(2, info["current"].asInt());
-}
 
 TEST_F(QueueTest, RepeatModesStepAsTheyShould)
 {
@@ -243,70 +205,41 @@ TEST_F(QueueTest, RemovingAndInsertingAroundTheCurrentSong)
     EXPECT_EQ(2u, p.Current());
 }
 
-TEST_F(QueueTest, TenThousandSongs)
+// "first-last" of a list page's sequence numbers ("" when empty, "gap" when
+// not consecutive).
+std::string Seqs(const Json::Value &reply)
 {
-    const int n = 10000;
-    Fill(n);
-    ASSERT_EQ(0, p.SetMode(3));
-    ASSERT_EQ(0, p.ToggleShuffle());
-    std::vector<int32_t> expected = Identity(n);
-    ReferenceShuffle(expected);
-    ASSERT_EQ(expected, p.Order());
-    // A full round in "Repeat All" plays every song once and wraps.
-    std::vector<int> seen(n, 0);
-    std::string uri;
-    ASSERT_EQ(0, p.GetCurrentUri(uri));
-    ++seen[p.Current()];
-    for (int i = 1; i < n; ++i) {
-        ASSERT_EQ(0, p.Next(uri, true));
-        ++seen[p.Current()];
-    }
-    EXPECT_EQ(std::vector<int>(n, 1), seen);
-    EXPECT_EQ(PathOf(expected[0]), Step(1, true));
-    // Clearing keeps mode and shuffle.
-    ASSERT_EQ(0, p.Clear());
-    EXPECT_TRUE(p.Order().empty());
-    EXPECT_EQ(3, p.GetMode());
-    EXPECT_TRUE(p.IsShuffle());
-    EXPECT_EQ(-1, p.GetCurrentUri(uri));
+    const Json::Value &u = reply["uris"];
+    if (!u.isArray() || u.empty())
+        return "";
+    for (Json::ArrayIndex i = 1; i < u.size(); ++i)
+        if (u[i]["sequence"].asInt() != u[i - 1]["sequence"].asInt() + 1)
+            return "gap";
+    return u[0]["sequence"].asString() + "-" + u[u.size() - 1]["sequence"].asString();
 }
 
-const int kCount = 100000;
-
-// Taken before main, while nothing in this process has seeded rand().
-const std::vector<int> kUnseeded = [] {
-    std::vector<int> v(kCount);
-    for (int &x : v)
-        x = rand();
-    return v;
-}();
-
-TEST(TarnRand, MatchesTheUnseededCLibrarySequenceWhateverOthersSeed)
+TEST_F(QueueTest, ListPages)
 {
-    TarnRandGen gen, other;
-    std::vector<int> got(kCount);
-    for (int &x : got)
-        x = gen.Next();
-    EXPECT_EQ(kUnseeded, got);
-    EXPECT_EQ(kUnseeded[0], other.Next()) << "generators are independent";
-    gen.Reset();
-    EXPECT_EQ(kUnseeded[0], gen.Next());
-
-    TarnRandReset();
-    std::vector<int> mine;
-    for (int i = 0; i < 10; ++i)
-        mine.push_back(TarnRand());
-    // What a libupnp worker does: seed and draw from the shared C generator.
-    std::thread worker([] {
-        srand(12345);
-        for (int i = 0; i < 1000; ++i)
-            (void)rand();
-    });
-    worker.join();
-    srand(777);
-    for (int i = 0; i < 10; ++i)
-        mine.push_back(TarnRand());
-    EXPECT_EQ(std::vector<int>(kUnseeded.begin(), kUnseeded.begin() + 20), mine);
+    Json::Value empty;
+    ASSERT_EQ(0, p.ListJson(0, 20, empty));
+    EXPECT_TRUE(empty["uris"].isArray());
+    Fill(30);
+    struct {
+        int start, limit;
+        const char *seqs;
+    } pages[] = {
+        {0, 0, "0-29"}, {5, 0, "5-29"}, {5, 10, "5-14"}, {25, 10, "25-29"}, {29, 1, "29-29"}, {30, 0, ""},
+        // A negative limit means 20, a negative start 0; huge values neither overflow nor fail.
+        {0, -1, "0-19"}, {3, INT_MIN, "3-22"}, {-7, 4, "0-3"}, {INT_MIN, -5, "0-19"},
+        {0, INT_MAX, "0-29"}, {10, INT_MAX, "10-29"}, {INT_MAX, INT_MAX, ""},
+    };
+    for (const auto &pg : pages) {
+        Json::Value r;
+        EXPECT_EQ(0, p.ListJson(pg.start, pg.limit, r));
+        EXPECT_EQ(pg.seqs, Seqs(r)) << pg.start << " " << pg.limit;
+        EXPECT_TRUE(r["uris"].isArray());
+        EXPECT_EQ(30, r["total"].asInt());
+    }
 }
 
 }  // namespace
