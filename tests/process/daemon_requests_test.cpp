@@ -10,6 +10,7 @@
 
 #include <json/json.h>
 
+#include "daemon/ctrl.h"
 #include "daemon/tarn_types.h"
 #include "tests/harness/harness.h"
 
@@ -145,6 +146,49 @@ TEST_F(RequestsTest, QueueRecordsInsertPositionAndCutReplies)
     v = Ask(ACT_QUEUE_LIST, "20 3");
     EXPECT_EQ(23, v["total"].asInt());
     EXPECT_EQ(3u, v["uris"].size());
+}
+
+TEST_F(RequestsTest, ChangedFlagAndPlayerSelectionRules)
+{
+    EXPECT_EQ(0, PublishedChanged(0));
+    ASSERT_EQ(0, h.Request(ACT_SET_CHANGED));
+    EXPECT_EQ(1, PublishedChanged(1));
+    ASSERT_EQ(0, h.Request(ACT_CLEAR_CHANGED));
+    EXPECT_EQ(0, PublishedChanged(0));
+    // A failing source change (no media library) leaves the flag alone.
+    ASSERT_EQ(0, h.Request(ACT_SOURCE_NEXT));
+    usleep(50000);
+    EXPECT_EQ(0, PublishedChanged(0));
+    // Below -1 is logged; a renderer past the end is refused; the local
+    // player stays selected and takes its own actions.
+    ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "-2"));
+    EXPECT_EQ(1, h.CountLog("tarnaudiod:378 Bad player index [-2]"));
+    ASSERT_EQ(0, h.Request(ACT_SELECT_PLAYER, "3"));
+    ASSERT_EQ(0, h.Request(ACT_CYCLE_REPEAT_MODE));
+    EXPECT_EQ("Repeat One", Ask(ACT_QUEUE_LIST, "0 1")["mode"].asString());
+    EXPECT_EQ(0, h.CountLog("not handled"));
+}
+
+TEST_F(RequestsTest, ClientCallsAgainstTheDaemonAndWithoutIt)
+{
+    char buf[CTRL_REPLY_SIZE];
+    EXPECT_EQ(0, CtrlSetVolume(40));
+    EXPECT_EQ(0, InfoGetStatus(buf, sizeof(buf)));
+    EXPECT_EQ(40, Parse(buf)["Volume"].asInt());
+    EXPECT_EQ(0, InfoListRenderers(0, 5, buf, sizeof(buf)));
+    EXPECT_EQ(5, Parse(buf)["limit"].asInt());
+    const float gains[10] = {0};
+    for (int rc : {CtrlVolumeUp(), CtrlMute(), CtrlSeek(5), CtrlNext(), CtrlPrevious(), CtrlStop(),
+                   CtrlSetEqualizer(gains), InfoSearchServers(), InfoSelectPlayer(-1), CtrlSaveCustom(1)})
+        EXPECT_EQ(0, rc);
+    EXPECT_TRUE(StillAnswers());
+    // With the daemon gone the calls fail and tarnctl says how to start it.
+    EXPECT_EQ(0, h.Stop());
+    EXPECT_EQ(-1, CtrlStop());
+    std::string out;
+    EXPECT_EQ(1, h.Run({tarntest::BinPath("tarnctl"), "status"}, &out));
+    EXPECT_NE(std::string::npos, out.find("tarnaudiod is not running")) << out;
+    ASSERT_EQ(0, h.Start()) << h.Error();  // for TearDown
 }
 
 }  // namespace

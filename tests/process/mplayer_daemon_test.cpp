@@ -6,6 +6,10 @@
 // format, back to back.
 #include <gtest/gtest.h>
 
+#include <netinet/in.h>
+
+#include <arpa/inet.h>
+
 #include <json/json.h>
 #include <poll.h>
 #include <signal.h>
@@ -15,6 +19,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <functional>
 #include <string>
@@ -300,6 +305,81 @@ std::string Text(const volatile char *p, size_t n)
 {
     const char *c = const_cast<const char *>(p);
     return std::string(c, strnlen(c, n));
+}
+
+// A radio station on loopback: the demo mp3 looped at about 128 kbit/s,
+// an ICY name, and a metadata block every 8000 bytes whose stream title
+// changes after 5 s.
+struct IcyStation {
+    int listenFd = -1;
+    std::atomic<bool> stop{false};
+    std::thread thread;
+    std::string Start(const std::string &mp3)
+    {
+        listenFd = socket(AF_INET, SOCK_STREAM, 0);
+        sockaddr_in a{};
+        a.sin_family = AF_INET;
+        a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        socklen_t len = sizeof(a);
+        if (bind(listenFd, (sockaddr *)&a, len) != 0 || listen(listenFd, 4) != 0 ||
+            getsockname(listenFd, (sockaddr *)&a, &len) != 0)
+            return "";
+        thread = std::thread([this, mp3] {
+            for (int fd; !stop && (fd = accept(listenFd, nullptr, nullptr)) >= 0; close(fd)) {
+                char req[4096];
+                if (read(fd, req, sizeof(req)) <= 0)
+                    continue;
+                std::string out = "HTTP/1.0 200 OK\r\nContent-Type: audio/mpeg\r\nicy-name: Tarn Test Radio\r\n"
+                                  "icy-metaint: 8000\r\n\r\n";
+                auto t0 = std::chrono::steady_clock::now();
+                for (size_t sent = 0, pos = 0; !stop; sent += 8000) {
+                    for (size_t block = 0; block < 8000;) {
+                        size_t n = std::min(8000 - block, mp3.size() - pos);
+                        out.append(mp3, pos, n);
+                        block += n;
+                        pos = (pos + n) % mp3.size();
+                    }
+                    double secs = std::chrono::duration<double>(std::chrono::steady_clock::now() - t0).count();
+                    std::string m = std::string("StreamTitle='") + (secs < 5 ? "First Song" : "Second Song") + "';";
+                    m.resize((m.size() + 15) / 16 * 16, '\0');
+                    out += char(m.size() / 16) + m;
+                    if (send(fd, out.data(), out.size(), MSG_NOSIGNAL) < 0)
+                        break;
+                    out.clear();
+                    if (sent > 32000)
+                        SleepMs(500);  // 8000 bytes a half second after a short burst
+                }
+            }
+        });
+        return "http://127.0.0.1:" + std::to_string(ntohs(a.sin_port)) + "/stream";
+    }
+    ~IcyStation()
+    {
+        stop = true;
+        shutdown(listenFd, SHUT_RDWR);
+        close(listenFd);
+        if (thread.joinable())
+            thread.join();
+    }
+};
+
+// A radio stream: the published title is the stream title, the artist the
+// station name, and both follow the stream.
+TEST_F(LocalPlaybackTest, RadioStreamPublishesStationAndChangingTitle)
+{
+    IcyStation station;
+    std::string url = station.Start(h.ReadFile("/songs/tone-440.mp3"));
+    ASSERT_FALSE(url.empty());
+    ASSERT_EQ(0, h.QueueAdd(MakeMediaInfo(url, "Queue Entry", "Queue Artist", 0)));
+    ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "0"));
+    auto published = [&](const char *title) {
+        const PublishedStatusShm *pub = h.PublishedSegment();
+        return pub && std::string(pub->title) == title && std::string(pub->artist) == "Tarn Test Radio";
+    };
+    EXPECT_TRUE(WaitFor([&] { return published("First Song"); }, 10000)) << h.PublishedSegment()->title;
+    EXPECT_TRUE(WaitFor([&] { return published("Second Song"); }, 15000)) << h.PublishedSegment()->title;
+    EXPECT_EQ(PLAYER_STATE_PLAYING, h.PublishedSegment()->state);
+    StopAndWait();
 }
 
 class MplayerDaemonTest : public ::testing::Test {
