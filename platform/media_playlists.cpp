@@ -14,6 +14,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "platform/json_read.h"
 #include "platform/medialib.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
@@ -273,6 +274,9 @@ int TARNIPodListSongsAll(const char *path, std::vector<TARN_MEDIA_INFO> &songs, 
 // ---------------------------------------------------------------------------
 // Custom slots: {"slots": {"<n>": {"type": ..., "second": ..., "third": ...}}}
 
+// Far more than the slots ever need.
+static const size_t kCustomSlotsMaxBytes = 1024 * 1024;
+
 static std::string CustomSlotsPath()
 {
     return TarnPath("/usr/tarn/etc/audio/custom_slots.json");
@@ -280,15 +284,12 @@ static std::string CustomSlotsPath()
 
 static int ReadSlots(Json::Value *root)
 {
-    std::ifstream in(CustomSlotsPath(), std::ios::binary);
-    if (!in)
+    std::string path = CustomSlotsPath();
+    if (access(path.c_str(), F_OK) != 0)
         return -1;
-    std::stringstream ss;
-    ss << in.rdbuf();
-    Json::CharReaderBuilder b;
     std::string errs;
-    std::istringstream is(ss.str());
-    if (!Json::parseFromStream(b, is, root, &errs) || !root->isObject()) {
+    if (JsonReadFileBounded(path, kCustomSlotsMaxBytes, JSON_READ_MAX_DEPTH, root, &errs) != 0 ||
+        !root->isObject()) {
         TLOG("Custom slot file %s is damaged: %s", CustomSlotsPath().c_str(), errs.c_str());
         return -1;
     }

@@ -9,6 +9,7 @@
 #include <curl/curl.h>
 
 #include "daemon/tarn_types.h"
+#include "platform/json_read.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"
@@ -175,8 +176,8 @@ int RadioDirectoryFetch(const std::string &url, std::string &body, long timeoutS
 int RadioDirectoryToList(const std::string &body, Json::Value &list)
 {
     Json::Value answer;
-    Json::Reader reader;
-    if (!reader.parse(body, answer, false) || !answer.isArray())
+    if (JsonParseBounded(body, kMaxBodyBytes, JSON_READ_MAX_DEPTH, &answer, nullptr) != 0 ||
+        !answer.isArray())
         return -1;
     Json::Value stations(Json::arrayValue);
     for (Json::ArrayIndex i = 0; i < answer.size(); i++) {

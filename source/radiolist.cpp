@@ -10,6 +10,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "daemon/tarn_types.h"
+#include "platform/json_read.h"
 #include "platform/radio_fetch.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
@@ -137,6 +139,27 @@ void NormalizeBitrates(Json::Value &list)
     }
 }
 
+// A positive number from key of the configuration file, or fallback.
+static unsigned long ConfNumber(const char *key, unsigned long fallback)
+{
+    char value[32];
+    std::string conf = TarnPath(TARN_INFO_CONF);
+    if (TLIBCFileGetKeyValue(conf.c_str(), key, value, sizeof(value), 0) <= 0)
+        return fallback;
+    long n = strtol(value, nullptr, 10);
+    return n > 0 ? static_cast<unsigned long>(n) : fallback;
+}
+
+size_t RadioListMaxBytes()
+{
+    return ConfNumber("radio_list_max_bytes", RADIO_LIST_DEFAULT_MAX_BYTES);
+}
+
+unsigned RadioListMaxStations()
+{
+    return static_cast<unsigned>(ConfNumber("radio_list_max_stations", RADIO_LIST_DEFAULT_MAX_STATIONS));
+}
+
 namespace {
 
 // A member of a station object; null for anything that is not an object.
@@ -165,10 +188,17 @@ bool MakeListShape(Json::Value &list)
 // an empty text, which is no valid JSON.
 int ReadListFile(const std::string &path, Json::Value &list)
 {
-    std::ifstream in(path.c_str(), std::ios::in | std::ios::binary);
-    Json::Reader reader;
-    if (!reader.parse(in, list, true)) {
-        TLOG("Failed to parse json file [%s]", path.c_str());
+    std::string why;
+    if (JsonReadFileBounded(path, RadioListMaxBytes(), JSON_READ_MAX_DEPTH, &list, &why) != 0) {
+        TLOG("Failed to parse json file [%s]: %s", path.c_str(), why.c_str());
+        return -1;
+    }
+    const Json::Value &stations = list.isObject() ? list["stations"] : Json::Value::nullSingleton();
+    unsigned max = RadioListMaxStations();
+    if (stations.isArray() && stations.size() > max) {
+        TLOG("Radio list [%s] holds %u stations, more than radio_list_max_stations (%u)", path.c_str(),
+             static_cast<unsigned>(stations.size()), max);
+        list = Json::Value();
         return -1;
     }
     NormalizeBitrates(list);
@@ -196,8 +226,7 @@ int RadioListGet(int type, Json::Value &list)
         TLOG("Could not find the path of type: %d", type);
         return -1;
     }
-    std::ifstream in(path.c_str(), std::ios::in | std::ios::binary);
-    if (!in.is_open()) {
+    if (access(path.c_str(), F_OK) != 0) {
         // No list written yet: the stations shipped with the appliance.
         if (AsxImportDefault(type, list) != 0) {
             list["stations"] = Json::Value(Json::arrayValue);
@@ -205,13 +234,7 @@ int RadioListGet(int type, Json::Value &list)
         }
         return 0;
     }
-    Json::Reader reader;
-    if (!reader.parse(in, list, true)) {
-        TLOG("Failed to parse json file [%s]", path.c_str());
-        return -1;
-    }
-    NormalizeBitrates(list);
-    return 0;
+    return ReadListFile(path, list);
 }
 
 int RadioioListGet(Json::Value &list, bool force)
@@ -318,13 +341,13 @@ int RadioListSave(const char *path, const Json::Value &list)
     // A full disk may show only when the buffered text is flushed.
     bool ok = written == text.size() && fflush(fp) == 0 && fsync(fileno(fp)) == 0;
     if (!ok) {
-        TLOG("Failed to fwrite, [%m]");
+        TLOG("Failed to fwrite [%s], [%m]", tmp.c_str());
         fclose(fp);
         unlink(tmp.c_str());
         return -1;
     }
     if (fclose(fp) != 0) {
-        TLOG("Failed to fwrite, [%m]");
+        TLOG("Failed to fwrite [%s], [%m]", tmp.c_str());
         unlink(tmp.c_str());
         return -1;
     }
@@ -336,8 +359,10 @@ int RadioListSave(const char *path, const Json::Value &list)
     return 0;
 }
 
-int RadioListAdd(int type, const Json::Value &stations)
+int RadioListAdd(int type, const Json::Value &stations, bool *saved)
 {
+    if (saved)
+        *saved = false;
     std::string path;
     if (RadioListPath(type, path) != 0) {
         TLOG("Could not find the path of type: %d", type);
@@ -355,12 +380,16 @@ int RadioListAdd(int type, const Json::Value &stations)
     }
     list["total"] = all.size();
     if (RadioListSave(path.c_str(), list) != 0)
-        TLOG("Could not save list of type: %d", type);
+        TLOG("Could not save list of type: %d to [%s]", type, path.c_str());
+    else if (saved)
+        *saved = true;
     return 0;
 }
 
-int RadioListEdit(int type, unsigned index, const Json::Value &station)
+int RadioListEdit(int type, unsigned index, const Json::Value &station, bool *saved)
 {
+    if (saved)
+        *saved = false;
     std::string path;
     if (RadioListPath(type, path) != 0) {
         TLOG("Could not find the path of type: %d", type);
@@ -384,12 +413,16 @@ int RadioListEdit(int type, unsigned index, const Json::Value &station)
     target["name"] = Member(station, "name");
     target["url"] = Member(station, "url");
     if (RadioListSave(path.c_str(), list) != 0)
-        TLOG("Could not save list of type: %d", type);
+        TLOG("Could not save list of type: %d to [%s]", type, path.c_str());
+    else if (saved)
+        *saved = true;
     return 0;
 }
 
-int RadioListDelete(int type, const std::string &selection)
+int RadioListDelete(int type, const std::string &selection, bool *saved)
 {
+    if (saved)
+        *saved = false;
     std::string path;
     if (RadioListPath(type, path) != 0) {
         TLOG("Could not find the path of type: %d", type);
@@ -403,6 +436,8 @@ int RadioListDelete(int type, const std::string &selection)
     Json::Value &stations = list["stations"];
     if (stations.size() == 0) {
         TLOG("No stations to delete.");
+        if (saved)
+            *saved = true;
         return 0;
     }
     TLIBC_SZLIST *items = TLIBCSzListAlloc(1024);
@@ -416,6 +451,8 @@ int RadioListDelete(int type, const std::string &selection)
     if (count == 0) {
         TLOG("There is no selected item.");
         TLIBCSzListFree(items);
+        if (saved)
+            *saved = true;
         return 0;
     }
 
@@ -447,7 +484,9 @@ int RadioListDelete(int type, const std::string &selection)
     }
     kept["total"] = kept["stations"].size();
     if (RadioListSave(path.c_str(), kept) != 0)
-        TLOG("Could not save list of type: %d", type);
+        TLOG("Could not save list of type: %d to [%s]", type, path.c_str());
+    else if (saved)
+        *saved = true;
     TLIBCSzListFree(items);
     return 0;
 }

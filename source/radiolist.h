@@ -45,6 +45,14 @@ int ShoutcastGenreList(Json::Value &array);
 int RadioListIsStale(const char *path);
 void NormalizeBitrates(Json::Value &list);
 
+// Limits on a radio list file read from disk (configuration keys
+// "radio_list_max_bytes" and "radio_list_max_stations"): a larger list is
+// refused like a damaged one, with a log line.
+#define RADIO_LIST_DEFAULT_MAX_BYTES (4UL * 1024 * 1024)
+#define RADIO_LIST_DEFAULT_MAX_STATIONS 5000
+size_t RadioListMaxBytes();
+unsigned RadioListMaxStations();
+
 int RadioListGet(int type, Json::Value &list);
 int RadioioListGet(Json::Value &list, bool force);
 int ShoutcastListGet(int index, Json::Value &list, bool force);
@@ -53,8 +61,11 @@ int ShoutcastListGetByGenre(const char *genre, Json::Value &list, bool force);
 // Writes the list to path. The text goes to a temporary file beside path
 // which then replaces it, so a failed write leaves the old file intact.
 int RadioListSave(const char *path, const Json::Value &list);
-int RadioListAdd(int type, const Json::Value &stations);
-int RadioListEdit(int type, unsigned index, const Json::Value &station);
-int RadioListDelete(int type, const std::string &selection);
+// The edits answer as they always have (a list that could not be written
+// still counts as edited, with a log line naming the file); saved, when
+// given, tells whether the list on disk now holds the edit.
+int RadioListAdd(int type, const Json::Value &stations, bool *saved = nullptr);
+int RadioListEdit(int type, unsigned index, const Json::Value &station, bool *saved = nullptr);
+int RadioListDelete(int type, const std::string &selection, bool *saved = nullptr);
 
 #endif

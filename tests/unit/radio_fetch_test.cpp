@@ -1,5 +1,6 @@
 // Radio directory updaters against a directory served on 127.0.0.1 by the
-// test itself: good answers, garbage, errors, oversized, slow and no answers.
+// test itself: good answers, garbage, nesting deep enough to exhaust a
+// recursive parser, errors, oversized, slow and no answers.
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -49,6 +50,8 @@ protected:
                 res.set_content("<html>busy</html>", "text/html");
             else if (kind == "object")
                 res.set_content("{\"stations\": []}", "application/json");
+            else if (kind == "nested")
+                res.set_content(std::string(5000, '['), "application/json");
             else if (kind == "big")
                 res.set_content("[" + std::string(5 * 1024 * 1024, ' ') + "]", "application/json");
             else if (kind == "slow")
@@ -123,6 +126,7 @@ TEST_F(RadioFetchTest, FailedFetchesWriteNothing)
     // the 1 s limit ends the wait. Nothing listens on port 1.
     struct Case { std::string url; const char *log; } cases[] = {
         {base + "garbage", "is not a station list"}, {base + "object", "is not a station list"},
+        {base + "nested", "is not a station list"},
         {base + "error", "HTTP status 500"}, {base + "big", "is larger than"},
         {base + "slow", "Failed to fetch"}, {"http://127.0.0.1:1", "Failed to fetch"}};
     for (const Case &c : cases) {

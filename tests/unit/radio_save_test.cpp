@@ -58,9 +58,15 @@ TEST(RadioListSaveFullDisk, FailedSaveLeavesTheOldList)
     EXPECT_EQ(-1, RadioListSave(path.c_str(), big));
     EXPECT_EQ(1, h.CountLog("Failed to fwrite")) << h.Log();
     EXPECT_EQ(before, h.ReadFile(TARN_RADIO_FAVORITE));
-    // Through an edit: logged, still success, old list intact.
-    EXPECT_EQ(0, RadioListAdd(2, big["stations"]));
-    EXPECT_EQ(1, h.CountLog("Could not save list of type: 2"));
+    // Through an edit: still success, but the log names the file and the
+    // caller can tell that nothing was saved; the old list is intact.
+    bool saved = true;
+    EXPECT_EQ(0, RadioListAdd(2, big["stations"], &saved));
+    EXPECT_FALSE(saved);
+    EXPECT_EQ(1, h.CountLog("Could not save list of type: 2 to [" + path + "]")) << h.Log();
+    saved = true;
+    EXPECT_EQ(0, RadioListEdit(2, 0, big["stations"][0], &saved));
+    EXPECT_FALSE(saved);
     EXPECT_EQ(before, h.ReadFile(TARN_RADIO_FAVORITE));
     std::string out;  // no temporary file is left behind
     ASSERT_EQ(0, h.Run({"/bin/ls", "-A", dir}, &out));
@@ -70,6 +76,9 @@ TEST(RadioListSaveFullDisk, FailedSaveLeavesTheOldList)
     ASSERT_EQ(0, unlink((dir + "/filler").c_str()));
     ASSERT_EQ(0, RadioListSave(path.c_str(), big));
     EXPECT_EQ(Json::StyledWriter().write(big), h.ReadFile(TARN_RADIO_FAVORITE));
+    ASSERT_EQ(0, RadioListSave(path.c_str(), small));
+    EXPECT_EQ(0, RadioListDelete(2, "0", &saved));
+    EXPECT_TRUE(saved) << h.Log();
     EXPECT_EQ(0, umount2(dir.c_str(), MNT_DETACH));
 }
 
