@@ -18,6 +18,7 @@
 #include <json/json.h>
 
 #include "fuzz/fuzz_root.h"
+#include "platform/json_read.h"
 #include "source/radiolist.h"
 
 namespace {
@@ -78,15 +79,14 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
     long oldCount = -1;
     {
         Json::Value old;
-        Json::Reader oldReader;
-        if (oldReader.parse(std::string(body, fileLen), old, true) && old.isObject() &&
+        if (JsonParseBounded(std::string(body, fileLen), 1 << 20, JSON_READ_MAX_DEPTH, &old, nullptr) == 0 &&
+            old.isObject() &&
             old["stations"].isArray())
             oldCount = static_cast<long>(old["stations"].size());
     }
     Json::Value list;
     int rc = 0;
     Json::Value argJson;
-    Json::Reader reader;
     switch (op) {
     case 0:
         rc = RadioListGet(type, list);
@@ -94,11 +94,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
             NormalizeBitrates(list);
         return 0;
     case 1:
-        reader.parse(arg, argJson, false);
+        JsonParseBounded(arg, 1 << 20, JSON_READ_MAX_DEPTH, &argJson, nullptr);
         rc = RadioListAdd(type, argJson);
         break;
     case 2:
-        reader.parse(arg, argJson, false);
+        JsonParseBounded(arg, 1 << 20, JSON_READ_MAX_DEPTH, &argJson, nullptr);
         rc = RadioListEdit(type, index, argJson);
         break;
     default:
@@ -115,7 +115,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
     // What was saved reads back as a list object with an array of stations,
     // and the count of stations moved as the edit says.
     Json::Value back;
-    Json::Reader backReader;
     std::string text;
     {
         FILE *fp = fopen(path.c_str(), "rb");
@@ -129,7 +128,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
     }
     if (text == std::string(body, fileLen))
         return 0;  // nothing to change, nothing written
-    if (!backReader.parse(text, back, false) || !back.isObject() || !back["stations"].isArray()) {
+    if (JsonParseBounded(text, 1 << 24, JSON_READ_MAX_DEPTH + 2, &back, nullptr) != 0 || !back.isObject() || !back["stations"].isArray()) {
         fprintf(stderr, "radio_list: edit %d saved no list: %s\n", op, text.c_str());
         abort();
     }
