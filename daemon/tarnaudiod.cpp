@@ -104,13 +104,38 @@ void SelectPlayer(const char *parameter, UpnpController *controller,
 // ---------------------------------------------------------------------------
 // Control requests.
 
+namespace {
+
+// Text as it is (UTF-8 written raw, control characters escaped), indented
+// like the replies always were.
+std::string ReplyText(const Json::Value &reply)
+{
+    static Json::StreamWriterBuilder *builder = [] {
+        Json::StreamWriterBuilder *b = new Json::StreamWriterBuilder();
+        (*b)["indentation"] = "   ";
+        (*b)["emitUTF8"] = true;
+        return b;
+    }();
+    return Json::writeString(*builder, reply) + "\n";
+}
+
+}  // namespace
+
 void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE])
 {
-#pragma GCC diagnostic push
-#pragma GCC diagnostic ignored "-Wdeprecated-declarations"
-    Json::StyledWriter writer;
-#pragma GCC diagnostic pop
-    std::string text = writer.write(reply);
+    std::string text = ReplyText(reply);
+    // A queue page that does not fit is cut by whole entries from its end, so
+    // that the reply stays valid JSON; "total" still tells the whole length.
+    if (text.size() >= CTRL_REPLY_SIZE && reply.isObject() && reply["uris"].isArray() &&
+        reply["uris"].size() > 0) {
+        Json::Value page = reply;
+        Json::Value &uris = page["uris"];
+        while (text.size() >= CTRL_REPLY_SIZE && uris.size() > 0) {
+            Json::Value removed;
+            uris.removeIndex(uris.size() - 1, &removed);
+            text = ReplyText(page);
+        }
+    }
     memset(buffer, 0, CTRL_REPLY_SIZE);
     snprintf(buffer, CTRL_REPLY_SIZE, "%s", text.c_str());
 }

@@ -371,8 +371,12 @@ int Playlist::ListJson(int start, int limit, Json::Value &reply)
     Json::Value uris(Json::arrayValue);
     int64_t first = start;
     int64_t end = static_cast<int64_t>(entries.size());
-    if (limit > 0)
-        end = std::min(end, first + limit);
+    // No reply holds more entries than this (each takes over 250 of its
+    // 8192 bytes); a longer page would only be built to be cut.
+    const int64_t kMostPerPage = 64;
+    if (limit <= 0 || limit > kMostPerPage)
+        limit = kMostPerPage;
+    end = std::min(end, first + limit);
     for (int64_t i = first; i < end; ++i) {
         const TARN_MEDIA_INFO *e = entries[static_cast<size_t>(i)];
         if (!e)
