@@ -7,7 +7,12 @@
 #include <cstring>
 #include <new>
 
+#include <malloc.h>
+
+#include "daemon/tarn_types.h"
+#include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
+#include "platform/tlibc_conf.h"
 #include "player/tarn_rand.h"
 
 static const char kLogUnit[] = "playlist";
@@ -105,11 +110,29 @@ void Playlist::ShuffleOrder()
 
 namespace {
 
+// Longest queue: "audio_queue_max" of the configuration file, read once.
+size_t QueueMax()
+{
+    static size_t max = [] {
+        char value[32];
+        std::string conf = TarnPath(TARN_INFO_CONF);
+        long n = 0;
+        if (TLIBCFileGetKeyValue(conf.c_str(), "audio_queue_max", value, sizeof(value), 0) > 0)
+            n = strtol(value, nullptr, 10);
+        return n > 0 ? static_cast<size_t>(n) : static_cast<size_t>(PLAYLIST_DEFAULT_MAX);
+    }();
+    return max;
+}
+
 // A private copy of a song record, with room made in both vectors so that
 // adding it cannot fail half-way. Null (logged) when memory runs out.
 TARN_MEDIA_INFO *NewEntry(const TARN_MEDIA_INFO *info, std::vector<TARN_MEDIA_INFO *> &entries,
                           std::vector<int32_t> &order)
 {
+    if (entries.size() >= QueueMax()) {
+        TLOG("The queue is full: %zu songs (audio_queue_max)", entries.size());
+        return nullptr;
+    }
     TARN_MEDIA_INFO *copy = new (std::nothrow) TARN_MEDIA_INFO;
     if (copy) {
         memcpy(copy, info, sizeof(TARN_MEDIA_INFO));
@@ -169,6 +192,8 @@ int Playlist::Clear()
     std::vector<int32_t>().swap(order);
     current = 0;
     orderIndex = 0;
+    // Give the memory of a long queue back to the system.
+    malloc_trim(0);
     return 0;
 }
 
@@ -425,7 +450,8 @@ int Playlist::HandleAction(const ControlRequest *request, Json::Value &reply)
     case ACT_QUEUE_ADD: {
         TARN_MEDIA_INFO info;
         memcpy(&info, request->parameter, sizeof(info));
-        AddSong(&info);
+        if (AddSong(&info) != 0 && entries.size() >= QueueMax())
+            reply["error"] = "the queue is full: " + std::to_string(QueueMax()) + " songs (audio_queue_max)";
         break;
     }
     case ACT_QUEUE_REMOVE:
@@ -439,7 +465,8 @@ int Playlist::HandleAction(const ControlRequest *request, Json::Value &reply)
         memcpy(&info, request->parameter, sizeof(info));
         int32_t index = 0;
         memcpy(&index, reinterpret_cast<const char *>(request) + CTRL_INSERT_POS_OFFSET, sizeof(index));
-        InsertSong(static_cast<unsigned>(index), &info);
+        if (InsertSong(static_cast<unsigned>(index), &info) != 0 && entries.size() >= QueueMax())
+            reply["error"] = "the queue is full: " + std::to_string(QueueMax()) + " songs (audio_queue_max)";
         break;
     }
     case ACT_QUEUE_SET_CURRENT:

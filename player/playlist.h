@@ -10,6 +10,10 @@
 
 #include "daemon/tarn_types.h"
 
+// Longest queue unless "audio_queue_max" of the configuration file says
+// otherwise (read once per process); a song beyond it is refused.
+#define PLAYLIST_DEFAULT_MAX 20000
+
 class Playlist {
 public:
     Playlist();

@@ -1,10 +1,11 @@
-// Files that a broken or hostile hand left in the daemon's folders: radio
-// lists and custom-slot files nested deep enough to exhaust a recursive
-// parser, and radio lists far larger than any household keeps. The daemon
-// refuses each with one log line and keeps serving; the bounded reader
-// refuses what no caller should get.
+// Inputs that a broken or hostile hand gives the daemon: radio lists and
+// custom-slot files nested deep enough to exhaust a recursive parser, radio
+// lists far larger than any household keeps, and a queue filled past its
+// limit. The daemon refuses each with one log line and keeps serving; the
+// bounded reader refuses what no caller should get.
 #include <gtest/gtest.h>
 
+#include <cstring>
 #include <string>
 
 #include <json/json.h>
@@ -117,6 +118,33 @@ TEST_F(HostileFiles, OversizedRadioListsAreRefusedByTheConfiguredLimits)
     ASSERT_EQ(0, h.Request(ACT_QUEUE_LIST, "0 14", &reply, 2000));
     ASSERT_TRUE(Json::Reader().parse(reply, q)) << reply;
     EXPECT_EQ(51, q["total"].asInt()) << reply;
+    EXPECT_EQ(0, h.Stop());
+}
+
+TEST(QueueLimit, SongsPastTheLimitAreRefusedWithAReason)
+{
+    tarntest::Harness h;
+    ASSERT_EQ(0, h.WriteFile(TARN_INFO_CONF, "audio_queue_max=5\n"));
+    ASSERT_EQ(0, h.Start()) << h.Error();
+    for (int i = 0; i < 5; i++)
+        ASSERT_EQ(0, h.QueueAdd(tarntest::MakeMediaInfo("/music/" + std::to_string(i) + ".mp3")));
+    std::string reply;
+    Json::Value v;
+    ControlRequest add = tarntest::MakeRequest(ACT_QUEUE_ADD);
+    TARN_MEDIA_INFO extra = tarntest::MakeMediaInfo("/music/extra.mp3");
+    memcpy(add.parameter, &extra, sizeof(extra));
+    ASSERT_EQ(0, h.RequestRaw(add, &reply));
+    ASSERT_TRUE(Json::Reader().parse(reply, v)) << reply;
+    EXPECT_EQ("the queue is full: 5 songs (audio_queue_max)", v["error"].asString()) << reply;
+    EXPECT_EQ(1, h.CountLog("The queue is full: 5 songs")) << h.Log();
+    ASSERT_EQ(0, h.Request(ACT_QUEUE_LIST, "0 10", &reply));
+    ASSERT_TRUE(Json::Reader().parse(reply, v)) << reply;
+    EXPECT_EQ(5, v["total"].asInt());
+    // Room again after a removal.
+    ASSERT_EQ(0, h.Request(ACT_QUEUE_REMOVE, "0"));
+    ASSERT_EQ(0, h.RequestRaw(add, &reply));
+    ASSERT_TRUE(Json::Reader().parse(reply, v)) << reply;
+    EXPECT_FALSE(v.isMember("error")) << reply;
     EXPECT_EQ(0, h.Stop());
 }
 
