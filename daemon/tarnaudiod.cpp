@@ -8,7 +8,8 @@
 #include <ctime>
 #include <fcntl.h>
 #include <string>
-#include <sys/select.h>
+#include <poll.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include "daemon/globals.h"
@@ -241,15 +242,28 @@ int HandleRequest(int fd, LocalPlayer *localPlayer, UpnpController *controller,
 // ---------------------------------------------------------------------------
 // Process start-up, loop and shutdown.
 
+// The self-pipe that wakes the loop's wait when SIGTERM arrives.
+static int g_wakePipe[2] = {-1, -1};
+
 void DaemonOnSigterm(int)
 {
+    int saved = errno;
     g_running = 0;
+    if (g_wakePipe[1] >= 0) {
+        ssize_t w = write(g_wakePipe[1], "t", 1);
+        (void)w;  // a full pipe already wakes the loop
+    }
+    errno = saved;
 }
 
 int DaemonSetupSignals()
 {
     if (signal(SIGPIPE, SIG_IGN) == SIG_ERR) {
         TarnLog("%s:%d Failed to signal()", kLogUnit, 44);
+        return -1;
+    }
+    if (g_wakePipe[0] < 0 && pipe2(g_wakePipe, O_CLOEXEC | O_NONBLOCK) != 0) {
+        TarnLog("%s:%d Failed to create the wake-up pipe, %m", kLogUnit, 47);
         return -1;
     }
     if (signal(SIGTERM, DaemonOnSigterm) == SIG_ERR) {
@@ -315,6 +329,7 @@ int DaemonStart(DaemonContext &ctx)
         return -1;
     }
     fcntl(ctx.ctrlListenFd, F_SETFD, FD_CLOEXEC);
+    fcntl(ctx.ctrlListenFd, F_SETFL, fcntl(ctx.ctrlListenFd, F_GETFL) | O_NONBLOCK);
     ctx.controller = new UpnpController();
     if (ctx.controller->Init() != 0) {
         TarnLog("%s:%d Failed to init Upnp Controller", kLogUnit, 471);
@@ -338,17 +353,100 @@ int DaemonStart(DaemonContext &ctx)
     return 0;
 }
 
+namespace {
+
+// The nearest of two timeouts in ms (-1: none).
+int Sooner(int a, int b)
+{
+    if (a < 0)
+        return b;
+    if (b < 0)
+        return a;
+    return a < b ? a : b;
+}
+
+// Reads the one request of a ready connection (one read, as ever), answers
+// it and hands the reply to the connection set.
+void ServeRequest(DaemonContext &ctx, int fd)
+{
+    GuardedRequest in;
+    memset(&in, 0, sizeof(in));
+    ssize_t n;
+    do {
+        n = read(fd, &in.request, CTRL_REQUEST_SIZE);
+    } while (n == -1 && errno == EINTR);
+    if (n != CTRL_REQUEST_SIZE) {
+        TarnLog("%s:%d Failed to read action [%m]", kLogUnit, 311);
+        ctx.conns.Close(fd);
+        return;
+    }
+    Json::Value reply;  // null unless a handler fills it
+    DispatchRequest(&in.request, reply, ctx.localPlayer, ctx.controller, ctx.upnpPlayers);
+    char out[CTRL_REPLY_SIZE];
+    FormatReply(reply, out);
+    ctx.conns.Reply(fd, out, sizeof(out));
+}
+
+// Sleeps until something is to be done; returns what poll saw.
+void WaitForWork(DaemonContext &ctx, std::vector<struct pollfd> &fds, size_t *connsFirst)
+{
+    fds.clear();
+    fds.push_back(pollfd{g_wakePipe[0], POLLIN, 0});
+    fds.push_back(pollfd{ctx.mplayerListenFd, POLLIN, 0});
+    // Once SIGTERM arrived no connection is taken, but those held are still
+    // answered (until their deadlines).
+    bool accepting = g_running && ctx.conns.Count() < CTRL_CONNS_MAX;
+    fds.push_back(pollfd{ctx.ctrlListenFd, static_cast<short>(accepting ? POLLIN : 0), 0});
+    fds.push_back(pollfd{ctx.localPlayer->GetMplayerFd(), POLLIN, 0});
+    *connsFirst = fds.size();
+    ctx.conns.AddPollFds(fds);
+
+    int timeout = ctx.conns.TimeoutMs();
+    timeout = Sooner(timeout, ctx.localPlayer->PollIntervalMs());
+    if (!ctx.upnpPlayers.empty())
+        timeout = Sooner(timeout, DAEMON_RENDERER_POLL_MS);
+    if (!g_running)
+        timeout = ctx.conns.TimeoutMs();
+    int n = poll(fds.data(), fds.size(), timeout);
+    if (n < 0) {
+        for (struct pollfd &p : fds)
+            p.revents = 0;  // EINTR: a signal; the turn goes on
+    }
+    if (fds[0].revents) {
+        char drain[64];
+        while (read(g_wakePipe[0], drain, sizeof(drain)) > 0) {
+        }
+    }
+}
+
+}  // namespace
+
 void DaemonLoopTurn(DaemonContext &ctx)
 {
-    usleep(100);
+    std::vector<struct pollfd> fds;
+    size_t connsFirst = 0;
+    WaitForWork(ctx, fds, &connsFirst);
 
-    int fd = SocketAcceptPoll(ctx.mplayerListenFd);
-    if (fd >= 0)
-        ctx.localPlayer->AttachMplayerFd(fd);
+    if (fds[1].revents) {
+        int fd = SocketAcceptPoll(ctx.mplayerListenFd);
+        if (fd >= 0)
+            ctx.localPlayer->AttachMplayerFd(fd);
+    }
+    // mplayer-daemon never writes on its connection: readable means closed.
+    if (fds[3].fd >= 0 && fds[3].fd == ctx.localPlayer->GetMplayerFd() && fds[3].revents) {
+        char byte;
+        ssize_t r = recv(fds[3].fd, &byte, 1, MSG_DONTWAIT);
+        if (r == 0 || (r < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR))
+            ctx.localPlayer->OnMplayerClosed();
+    }
 
-    fd = SocketAcceptPoll(ctx.ctrlListenFd);
-    if (fd >= 0)
-        HandleRequest(fd, ctx.localPlayer, ctx.controller, ctx.upnpPlayers);
+    ctx.conns.TakeReady(fds, connsFirst);
+    int ready = ctx.conns.NextReadable();
+    if (ready >= 0)
+        ServeRequest(ctx, ready);
+    ctx.conns.Service();
+    if (fds[2].revents)
+        ctx.conns.AcceptAll(ctx.ctrlListenFd);
 
     // Local playback goes on while a renderer is selected.
     ctx.localPlayer->Poll(ctx.playerShm);
@@ -401,6 +499,7 @@ void DaemonLoopTurn(DaemonContext &ctx)
 int DaemonShutdown(DaemonContext &ctx)
 {
     TarnLog("%s:%d tarnaudiod exit", kLogUnit, 530);
+    ctx.conns.CloseAll();
     if (ctx.ctrlListenFd >= 0) {
         close(ctx.ctrlListenFd);
         unlink(TarnPath(TARN_CTRL_SOCKET).c_str());
@@ -448,6 +547,6 @@ int DaemonRun()
         return DaemonShutdown(ctx);
     do {
         DaemonLoopTurn(ctx);
-    } while (g_running);
+    } while (g_running || ctx.conns.Count() > 0);
     return DaemonShutdown(ctx);
 }

@@ -7,6 +7,7 @@
 
 #include <json/json.h>
 
+#include "daemon/ctrl_conns.h"
 #include "daemon/tarn_types.h"
 
 class LocalPlayer;
@@ -22,9 +23,14 @@ struct DaemonContext {
     PlayerStatusShm *playerShm = nullptr;
     PublishedStatusShm *publishedShm = nullptr;
     std::vector<UpnpPlayer *> upnpPlayers;  // in order of creation
+    ControlConnections conns;               // accepted control connections
 };
 
-// SIGTERM: clears the running flag, nothing else.
+// How often renderer players are polled while any exists (their own
+// deadlines decide what each poll sends).
+#define DAEMON_RENDERER_POLL_MS 100
+
+// SIGTERM: clears the running flag and wakes the loop's wait.
 void DaemonOnSigterm(int sig);
 
 // SIGPIPE ignored, SIGTERM handled; 0 or -1.
@@ -38,7 +44,10 @@ int DaemonInit();
 // (what was created stays in ctx for DaemonShutdown).
 int DaemonStart(DaemonContext &ctx);
 
-// One turn of the main loop.
+// One turn of the main loop: sleeps in one poll until a socket is ready, a
+// deadline is due or a signal arrives; then accepts at most one
+// mplayer-daemon connection, serves at most one control request, polls the
+// players, writes the changed flag and publishes the selected player.
 void DaemonLoopTurn(DaemonContext &ctx);
 
 // Releases everything in order, removes the pid file. Returns 0.

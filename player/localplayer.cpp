@@ -11,6 +11,7 @@
 #include <cstring>
 #include <sys/select.h>
 #include <sys/socket.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include "audio/info.h"
@@ -243,6 +244,7 @@ void LocalPlayer::CloseMplayerFd()
 
 int LocalPlayer::StartMplayer(const std::string &uri)
 {
+    lastError.clear();
     if (IsMplayerAlive())
         KillMplayer();
     // Whatever connection is left belongs to a process that is gone; the new
@@ -280,6 +282,7 @@ int LocalPlayer::StartMplayer(const std::string &uri)
 
 int LocalPlayer::LoadFile(const std::string &uri)
 {
+    lastError.clear();
     std::string cmd = LoadFileCommand(uri);
     if (SendCommand(cmd.data(), cmd.size()) != 0) {
         TLOG("Failed to send action [%s]", cmd.c_str());
@@ -552,7 +555,28 @@ int LocalPlayer::GetStatusJson(Json::Value &reply)
     reply["StreamTitle"] = streamTitle;
     reply["RadioStation"] = radioStation;
     reply["Volume"] = volume;
+    reply["last_error"] = lastError;
     return 0;
+}
+
+int LocalPlayer::PollIntervalMs() const
+{
+    if (mplayerFd < 0)
+        return -1;
+    return state == PLAYER_STATE_PAUSED ? 1000 : 20;
+}
+
+void LocalPlayer::OnMplayerClosed()
+{
+    if (mplayerFd < 0)
+        return;
+    CloseMplayerFd();
+    TLOG("mplayer-daemon ended while playing [%s]", currentUri.c_str());
+    lastError = "the player program ended unexpectedly";
+    state = PLAYER_STATE_STOPPED;
+    // It is our child when we started it: collect its exit status.
+    while (waitpid(-1, nullptr, WNOHANG) > 0) {
+    }
 }
 
 void LocalPlayer::SaveVolumeAndKill()

@@ -43,6 +43,16 @@ public:
     int GetMplayerFd() const { return mplayerFd; }
     int GetPosition() const { return position; }
     const std::string &GetCurrentUri() const { return currentUri; }
+    // Why playback last stopped on its own ("" when it did not).
+    const std::string &GetLastError() const { return lastError; }
+
+    // How soon the loop must poll again, in ms: often while a song plays
+    // (its end is acted on within a poll), seldom while paused, never (-1)
+    // while mplayer-daemon is not connected.
+    int PollIntervalMs() const;
+    // mplayer-daemon's connection was closed by its end: the player stops,
+    // with the reason kept for status. The child is reaped.
+    void OnMplayerClosed();
 
     // The "loadfile" command text for uri: backslashes doubled, double
     // quotes passed through as they are.
@@ -70,6 +80,7 @@ private:
     std::string radioStation;
     time_t lastVolumeCheck;
     int32_t volume;
+    std::string lastError;
 };
 
 #endif

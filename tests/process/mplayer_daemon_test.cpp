@@ -276,6 +276,11 @@ TEST_F(LocalPlaybackTest, HungOrKilledPlayerDoesNotBlockTheDaemon)
     ASSERT_EQ(0, kill(pid, SIGKILL));
     kill(pid, SIGCONT);
     ASSERT_TRUE(WaitFor([&] { h.Reap(); return kill(pid, 0) != 0; }, 3000));
+    // The daemon sees its player gone: stopped, with the reason kept for
+    // status, never "playing" with a frozen position.
+    ASSERT_TRUE(WaitFor([&] { return Status()["PlayerState"].asInt() == PLAYER_STATE_STOPPED; }, 2000));
+    EXPECT_EQ("the player program ended unexpectedly", Status()["last_error"].asString());
+    EXPECT_TRUE(WaitFor([&] { return h.PublishedSegment()->state == PLAYER_STATE_STOPPED; }, 1000));
     for (int action : {ACT_SET_VOLUME, ACT_MUTE, ACT_SEEK, ACT_NEXT, ACT_PREVIOUS})
         ASSERT_EQ(0, h.Request(action, "30", nullptr, 1000)) << "action " << action;
     EXPECT_TRUE(Status().isObject());
