@@ -1,5 +1,6 @@
 #include "daemon/tarnaudiod.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
@@ -122,21 +123,43 @@ std::string ReplyText(const Json::Value &reply)
 
 }  // namespace
 
+// The reply with as many whole queue entries as fit CTRL_REPLY_SIZE - 1
+// characters. Each entry's share is estimated from its own text (its lines
+// sit two levels deeper in the reply); the result is checked and, in the rare
+// case the estimate was short, cut further.
+static std::string CutQueuePage(const Json::Value &reply)
+{
+    Json::Value page = reply;
+    Json::Value &uris = page["uris"];
+    Json::Value all = uris;
+    uris = Json::Value(Json::arrayValue);
+    size_t used = ReplyText(page).size();
+    Json::ArrayIndex fit = 0;
+    for (; fit < all.size(); fit++) {
+        std::string item = ReplyText(all[fit]);
+        size_t lines = static_cast<size_t>(std::count(item.begin(), item.end(), '\n'));
+        used += item.size() + 6 * lines + 8;
+        if (used >= CTRL_REPLY_SIZE)
+            break;
+        uris.append(all[fit]);
+    }
+    std::string text = ReplyText(page);
+    while (text.size() >= CTRL_REPLY_SIZE && uris.size() > 0) {
+        Json::Value removed;
+        uris.removeIndex(uris.size() - 1, &removed);
+        text = ReplyText(page);
+    }
+    return text;
+}
+
 void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE])
 {
     std::string text = ReplyText(reply);
     // A queue page that does not fit is cut by whole entries from its end, so
     // that the reply stays valid JSON; "total" still tells the whole length.
     if (text.size() >= CTRL_REPLY_SIZE && reply.isObject() && reply["uris"].isArray() &&
-        reply["uris"].size() > 0) {
-        Json::Value page = reply;
-        Json::Value &uris = page["uris"];
-        while (text.size() >= CTRL_REPLY_SIZE && uris.size() > 0) {
-            Json::Value removed;
-            uris.removeIndex(uris.size() - 1, &removed);
-            text = ReplyText(page);
-        }
-    }
+        reply["uris"].size() > 0)
+        text = CutQueuePage(reply);
     memset(buffer, 0, CTRL_REPLY_SIZE);
     snprintf(buffer, CTRL_REPLY_SIZE, "%s", text.c_str());
 }

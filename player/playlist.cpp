@@ -41,13 +41,13 @@ const char *ModeName(int32_t mode)
     return kModeNames[mode];
 }
 
-// The title shown for a record: its title, else the file name of its path,
+// The title shown for an entry: its title, else the file name of its path,
 // else the whole path.
-std::string DisplayTitle(const TARN_MEDIA_INFO *info)
+std::string DisplayTitle(const QueueEntry *entry)
 {
-    if (info->title[0] != '\0')
-        return Field(info->title);
-    std::string path = Field(info->path);
+    if (!entry->title.empty())
+        return entry->title;
+    const std::string &path = entry->path;
     size_t slash = path.rfind('/');
     if (slash != std::string::npos && slash + 1 < path.size())
         return path.substr(slash + 1);
@@ -75,7 +75,53 @@ int32_t ParseDecimal(const std::string &text)
     return static_cast<int32_t>(v);
 }
 
+// Copies text into a fixed field, NUL-terminated.
+template <size_t N>
+void Put(char (&field)[N], const std::string &text)
+{
+    snprintf(field, N, "%s", text.c_str());
+}
+
 }  // namespace
+
+void QueueEntry::FromMediaInfo(const TARN_MEDIA_INFO &info)
+{
+    id = info.id;
+    track = info.track;
+    disc = info.disc;
+    year = info.year;
+    duration = info.duration;
+    bitrate = info.bitrate;
+    sample = info.sample;
+    channels = info.channels;
+    size = info.size;
+    path = Field(info.path);
+    title = Field(info.title);
+    album = Field(info.album);
+    artist = Field(info.artist);
+    genre = Field(info.genre);
+    albumArtUrl = Field(info.albumArtUrl);
+}
+
+void QueueEntry::ToMediaInfo(TARN_MEDIA_INFO *out) const
+{
+    memset(out, 0, sizeof(*out));
+    out->id = id;
+    out->track = track;
+    out->disc = disc;
+    out->year = year;
+    out->duration = duration;
+    out->bitrate = bitrate;
+    out->sample = sample;
+    out->channels = channels;
+    out->size = size;
+    Put(out->path, path);
+    Put(out->title, title);
+    Put(out->album, album);
+    Put(out->artist, artist);
+    Put(out->genre, genre);
+    Put(out->albumArtUrl, albumArtUrl);
+}
 
 Playlist::Playlist() : current(0), orderIndex(0), mode(1), shuffle(false)
 {
@@ -83,7 +129,7 @@ Playlist::Playlist() : current(0), orderIndex(0), mode(1), shuffle(false)
 
 Playlist::~Playlist()
 {
-    for (TARN_MEDIA_INFO *entry : entries)
+    for (QueueEntry *entry : entries)
         delete entry;
 }
 
@@ -124,25 +170,29 @@ size_t QueueMax()
     return max;
 }
 
-// A private copy of a song record, with room made in both vectors so that
-// adding it cannot fail half-way. Null (logged) when memory runs out.
-TARN_MEDIA_INFO *NewEntry(const TARN_MEDIA_INFO *info, std::vector<TARN_MEDIA_INFO *> &entries,
-                          std::vector<int32_t> &order)
+// A compact copy of a song record, with room made in both vectors so that
+// adding it cannot fail half-way. Null (logged) when the queue is full or
+// memory runs out.
+QueueEntry *NewEntry(const TARN_MEDIA_INFO *info, std::vector<QueueEntry *> &entries,
+                     std::vector<int32_t> &order)
 {
     if (entries.size() >= QueueMax()) {
         TLOG("The queue is full: %zu songs (audio_queue_max)", entries.size());
         return nullptr;
     }
-    TARN_MEDIA_INFO *copy = new (std::nothrow) TARN_MEDIA_INFO;
-    if (copy) {
-        memcpy(copy, info, sizeof(TARN_MEDIA_INFO));
-        try {
-            entries.reserve(entries.size() + 1);
-            order.reserve(entries.size() + 1);
-            return copy;
-        } catch (const std::bad_alloc &) {
-            delete copy;
-        }
+    QueueEntry *copy = nullptr;
+    try {
+        copy = new QueueEntry();
+        copy->FromMediaInfo(*info);
+        // Grown by doubling: a reserve of one more would copy the whole
+        // vector on every add.
+        if (entries.capacity() == entries.size())
+            entries.reserve(entries.size() * 2 + 16);
+        if (order.capacity() <= entries.size())
+            order.reserve(entries.capacity());
+        return copy;
+    } catch (const std::bad_alloc &) {
+        delete copy;
     }
     TLOG("Failed to new TARN_MEDIA_INFO");
     return nullptr;
@@ -156,7 +206,7 @@ int Playlist::AddSong(const TARN_MEDIA_INFO *info)
         TLOG("Bad parameter");
         return -1;
     }
-    TARN_MEDIA_INFO *copy = NewEntry(info, entries, order);
+    QueueEntry *copy = NewEntry(info, entries, order);
     if (!copy)
         return -1;
     entries.push_back(copy);
@@ -186,9 +236,9 @@ int Playlist::RemoveSong(unsigned index)
 
 int Playlist::Clear()
 {
-    for (TARN_MEDIA_INFO *entry : entries)
+    for (QueueEntry *entry : entries)
         delete entry;
-    std::vector<TARN_MEDIA_INFO *>().swap(entries);
+    std::vector<QueueEntry *>().swap(entries);
     std::vector<int32_t>().swap(order);
     current = 0;
     orderIndex = 0;
@@ -204,7 +254,7 @@ int Playlist::InsertSong(unsigned index, const TARN_MEDIA_INFO *info)
         TLOG("Bad parameters");
         return -1;
     }
-    TARN_MEDIA_INFO *copy = NewEntry(info, entries, order);
+    QueueEntry *copy = NewEntry(info, entries, order);
     if (!copy)
         return -1;
     entries.insert(entries.begin() + index, copy);
@@ -299,13 +349,13 @@ int Playlist::GetCurrentSong(TARN_MEDIA_INFO *out)
     current = static_cast<uint32_t>(order[orderIndex]);
     if (current >= entries.size())
         current = 0;
-    const TARN_MEDIA_INFO *entry = entries[current];
+    const QueueEntry *entry = entries[current];
     if (!entry) {
         TLOG("URL_INFO at %d in list is NULL", static_cast<int>(current));
         return -1;
     }
     if (out)
-        memcpy(out, entry, sizeof(TARN_MEDIA_INFO));
+        entry->ToMediaInfo(out);
     return 0;
 }
 
@@ -313,7 +363,7 @@ int Playlist::GetCurrentUri(std::string &uri)
 {
     if (GetCurrentSong(nullptr) != 0)
         return -1;
-    uri = Field(entries[current]->path);
+    uri = entries[current]->path;
     return 0;
 }
 
@@ -323,11 +373,11 @@ int Playlist::GetCurrentInfoJson(Json::Value &info)
         TLOG("Bad current index [%u]", current);
         return -1;
     }
-    const TARN_MEDIA_INFO *entry = entries[current];
+    const QueueEntry *entry = entries[current];
     info["title"] = DisplayTitle(entry);
     info["current"] = static_cast<int>(current);
-    info["artist"] = Field(entry->artist);
-    info["path"] = Field(entry->path);
+    info["artist"] = entry->artist;
+    info["path"] = entry->path;
     return 0;
 }
 
@@ -403,23 +453,23 @@ int Playlist::ListJson(int start, int limit, Json::Value &reply)
         limit = kMostPerPage;
     end = std::min(end, first + limit);
     for (int64_t i = first; i < end; ++i) {
-        const TARN_MEDIA_INFO *e = entries[static_cast<size_t>(i)];
+        const QueueEntry *e = entries[static_cast<size_t>(i)];
         if (!e)
             continue;
         Json::Value item(Json::objectValue);
         char text[64];
         snprintf(text, sizeof(text), "playing@%lu", static_cast<unsigned long>(e->id));
         item["item_id"] = text;
-        item["album"] = Field(e->album);
-        item["artist"] = Field(e->artist);
-        item["albumArtURL"] = e->albumArtUrl[0] != '\0' ? Field(e->albumArtUrl) : std::string(kDefaultAlbumArt);
-        item["genre"] = Field(e->genre);
+        item["album"] = e->album;
+        item["artist"] = e->artist;
+        item["albumArtURL"] = !e->albumArtUrl.empty() ? e->albumArtUrl : std::string(kDefaultAlbumArt);
+        item["genre"] = e->genre;
         item["item_pid"] = "playing_root";
         item["title"] = DisplayTitle(e);
         item["bitrate"] = static_cast<Json::UInt>(e->bitrate);
         item["duration"] = DurationSeconds(e->duration);
         item["channels"] = static_cast<int>(e->channels);
-        item["res"] = Field(e->path);
+        item["res"] = e->path;
         item["sample"] = static_cast<int>(e->sample);
         item["track"] = static_cast<int>(e->track);
         item["disc"] = static_cast<int>(e->disc);

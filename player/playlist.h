@@ -14,6 +14,23 @@
 // otherwise (read once per process); a song beyond it is refused.
 #define PLAYLIST_DEFAULT_MAX 20000
 
+// One queued song: what the daemon reads of a record, each text sized to
+// its content. A full record is rebuilt only where one is handed on.
+struct QueueEntry {
+    uint32_t id = 0;
+    int32_t track = 0, disc = 0, year = 0;
+    float duration = 0;
+    uint32_t bitrate = 0;
+    int32_t sample = 0, channels = 0;
+    uint64_t size = 0;
+    std::string path, title, album, artist, genre, albumArtUrl;
+
+    // The texts of info are read up to their field sizes (clients need not
+    // terminate them).
+    void FromMediaInfo(const TARN_MEDIA_INFO &info);
+    void ToMediaInfo(TARN_MEDIA_INFO *out) const;
+};
+
 class Playlist {
 public:
     Playlist();
@@ -31,7 +48,7 @@ public:
     int ToggleShuffle();
     int ToggleRepeatMode();
     bool IsShuffle() const;
-    // Copies the current entry into *out.
+    // Rebuilds the current entry's record into *out.
     int GetCurrentSong(TARN_MEDIA_INFO *out);
     int GetCurrentUri(std::string &uri);
     int GetCurrentInfoJson(Json::Value &info);
@@ -44,7 +61,7 @@ public:
     unsigned Current() const { return current; }
     unsigned OrderIndex() const { return orderIndex; }
     const std::vector<int32_t> &Order() const { return order; }
-    const TARN_MEDIA_INFO *Entry(unsigned index) const
+    const QueueEntry *Entry(unsigned index) const
     {
         return index < entries.size() ? entries[index] : nullptr;
     }
@@ -53,7 +70,7 @@ private:
     void ResetOrder();
     void ShuffleOrder();
 
-    std::vector<TARN_MEDIA_INFO *> entries;
+    std::vector<QueueEntry *> entries;
     std::vector<int32_t> order;
     uint32_t current;
     uint32_t orderIndex;
