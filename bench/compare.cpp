@@ -702,9 +702,12 @@ int LargestOurPage(Ours &o)
         std::string reply;
         if (!o.Text(ACT_QUEUE_LIST, "0 " + std::to_string(n), &reply))
             break;
-        // A page that does not fit is cut and no longer ends the JSON object.
-        if (reply.size() >= CTRL_REPLY_SIZE - 1 || reply.find_last_of('}') == std::string::npos ||
-            reply.size() < 2 || reply[reply.size() - 2] != '}')
+        // A page that does not fit holds fewer entries than asked for.
+        size_t entries = 0;
+        for (size_t at = reply.find("\"sequence\""); at != std::string::npos;
+             at = reply.find("\"sequence\"", at + 1))
+            entries++;
+        if (entries < static_cast<size_t>(n))
             break;
         best = n;
     }

@@ -37,17 +37,6 @@
 
 namespace {
 
-std::string HexOf(const std::string &bytes)
-{
-    std::string out;
-    char d[4];
-    for (unsigned char c : bytes) {
-        snprintf(d, sizeof(d), "%02x", c);
-        out += d;
-    }
-    return out;
-}
-
 size_t CountBytes(char *, size_t size, size_t n, void *total)
 {
     *static_cast<size_t *>(total) += size * n;
@@ -151,7 +140,7 @@ void Throughput(Bench &b, int runs)
         big[i] = static_cast<char>(i * 2654435761u >> 13);
     b.h.WriteFile("/media/usb/big.flac", big);
     std::string url = "http://127.0.0.1:18080/audio/webUI/audiotransfer.cgi/ipod/" +
-                      HexOf(b.h.Path("/media/usb/big.flac")) + ".flac";
+                      MediaPathToken(b.h.Path("/media/usb/big.flac")) + ".flac";
     pid_t web = tarnwebtest::StartSongServer(b.h, {"--port", "18080", "--bind", "127.0.0.1", "--threads", "8"});
     if (web <= 0) {
         printf("tarnweb did not start for the throughput runs\n");

@@ -5,7 +5,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <openssl/crypto.h>
 #include <openssl/evp.h>
+#include <openssl/hmac.h>
 #include <openssl/rand.h>
 
 #include <cstdio>
@@ -132,7 +134,75 @@ int HexValue(char c)
     return -1;
 }
 
+// The hex text of the first half of HMAC-SHA256(key, path).
+std::string PathMac(const unsigned char *key, const std::string &path)
+{
+    unsigned char mac[EVP_MAX_MD_SIZE];
+    unsigned int len = 0;
+    if (!HMAC(EVP_sha256(), key, kKeyLen, reinterpret_cast<const unsigned char *>(path.data()),
+              path.size(), mac, &len) ||
+        len < MEDIA_PATH_MAC_LEN / 2)
+        return std::string();
+    char hex[MEDIA_PATH_MAC_LEN + 1];
+    for (int i = 0; i < MEDIA_PATH_MAC_LEN / 2; ++i)
+        snprintf(hex + 2 * i, 3, "%02x", mac[i]);
+    return std::string(hex, MEDIA_PATH_MAC_LEN);
+}
+
 }  // namespace
+
+std::string MediaPathToken(const std::string &path)
+{
+    if (path.empty())
+        return std::string();
+    unsigned char key[kKeyLen];
+    if (GetKey(key) != 0)
+        return std::string();
+    std::string mac = PathMac(key, path);
+    if (mac.empty()) {
+        TLOG("Failed to sign path [%s]", path.c_str());
+        return std::string();
+    }
+    std::string token;
+    token.reserve(path.size() * 2 + 1 + mac.size());
+    char hex[3];
+    for (unsigned char c : path) {
+        snprintf(hex, sizeof(hex), "%02x", c);
+        token += hex;
+    }
+    return token + "-" + mac;
+}
+
+int MediaPathTokenDecode(const char *token, std::string *path)
+{
+    if (!token || !path)
+        return -1;
+    const char *dash = strchr(token, '-');
+    if (!dash || dash == token || (dash - token) % 2 != 0 || strlen(dash + 1) != MEDIA_PATH_MAC_LEN)
+        return -1;
+    std::string decoded;
+    for (const char *p = token; p < dash; p += 2) {
+        int hi = HexValue(p[0]), lo = HexValue(p[1]);
+        if (hi < 0 || lo < 0 || (hi == 0 && lo == 0))
+            return -1;
+        decoded += static_cast<char>(hi << 4 | lo);
+    }
+    std::string given(dash + 1);
+    for (char &c : given) {
+        if (HexValue(c) < 0)
+            return -1;
+        if (c >= 'A' && c <= 'F')
+            c = static_cast<char>(c - 'A' + 'a');
+    }
+    unsigned char key[kKeyLen];
+    if (GetKey(key) != 0)
+        return -1;
+    std::string mac = PathMac(key, decoded);
+    if (mac.size() != given.size() || CRYPTO_memcmp(mac.data(), given.data(), mac.size()) != 0)
+        return -1;
+    *path = decoded;
+    return 0;
+}
 
 int MediaIDEncryption(uint32_t id, char *out, size_t size)
 {

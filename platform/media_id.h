@@ -28,4 +28,17 @@ std::string MediaIDEncryption(uint32_t id);
 // caller decides) or when the secret cannot be read.
 int MediaIDDecryption(const char *token, uint32_t *id);
 
+// Path tokens, for songs without a library id and songs on USB volumes: the
+// lowercase hex text of the path's bytes, "-", and the first 16 bytes (32 hex
+// digits) of HMAC-SHA256 of the path under the same secret. Only a holder of
+// the secret can name a file this way.
+#define MEDIA_PATH_MAC_LEN 32
+
+// The token of path; empty on failure (logged) or for an empty path.
+std::string MediaPathToken(const std::string &path);
+
+// Decodes a path token into *path. 0, or -1 for a malformed, altered or
+// foreign token (not logged) or when the secret cannot be read.
+int MediaPathTokenDecode(const char *token, std::string *path);
+
 #endif

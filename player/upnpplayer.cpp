@@ -130,7 +130,10 @@ int UpnpPlayer::BuildSongUrl(const TARN_MEDIA_INFO *info, std::string &url)
 
     char buffer[kUrlSize];
     int n;
-    if (TARNAudioIsUSBVolume(path) != 1) {
+    // Songs of the library go by their id; songs on a USB volume and songs
+    // queued by path (no id) by a path token that only this installation
+    // can make.
+    if (TARNAudioIsUSBVolume(path) != 1 && info->id != 0) {
         char token[MEDIA_ID_TOKEN_LEN + 1];
         if (MediaIDEncryption(info->id, token, sizeof(token)) != 0) {
             TLOG("Failed to make the song id text of song [%u]", info->id);
@@ -139,14 +142,13 @@ int UpnpPlayer::BuildSongUrl(const TARN_MEDIA_INFO *info, std::string &url)
         n = snprintf(buffer, sizeof(buffer), "http://%s/audio/webUI/audiotransfer.cgi/%s.%s",
                      host.c_str(), token, ext);
     } else {
-        std::string hex;
-        char digits[4];
-        for (const unsigned char *p = reinterpret_cast<const unsigned char *>(path); *p; ++p) {
-            snprintf(digits, sizeof(digits), "%0x", *p);
-            hex += digits;
+        std::string token = MediaPathToken(path);
+        if (token.empty()) {
+            TLOG("Failed to make the path token of [%s]", path);
+            return -1;
         }
         n = snprintf(buffer, sizeof(buffer), "http://%s/audio/webUI/audiotransfer.cgi/ipod/%s.%s",
-                     host.c_str(), hex.c_str(), ext);
+                     host.c_str(), token.c_str(), ext);
     }
     if (n < 0 || n >= static_cast<int>(sizeof(buffer))) {
         TLOG("Song URL too long for [%s]", path);

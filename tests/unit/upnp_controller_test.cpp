@@ -374,7 +374,7 @@ protected:
     std::unique_ptr<UpnpPlayer> player;
 };
 
-TEST_F(UpnpPlayerTest, SongUrlsForStreamsLibraryAndUsbSongs)
+TEST_F(UpnpPlayerTest, SongUrlsForStreamsLibraryUsbAndByPathSongs)
 {
     const std::string base = "http://10.9.8.7:8080/audio/webUI/audiotransfer.cgi/";
     const std::string token = MediaIDEncryption(5);
@@ -383,12 +383,12 @@ TEST_F(UpnpPlayerTest, SongUrlsForStreamsLibraryAndUsbSongs)
         std::string url;
     } cases[] = {
         {"", "HTTP://Radio.Example:8000/Live?a=1&b=2", "HTTP://Radio.Example:8000/Live?a=1&b=2"},
-        {"", "/mnt/usb/a.mp3", base + "ipod/2f6d6e742f7573622f612e6d7033.mp3"},
-        {"", "/mnt/usb/\x01\x0f.ogg", base + "ipod/2f6d6e742f7573622f1f2e6f6767.ogg"},  // unpadded
+        {"", "/mnt/usb/a.mp3", base + "ipod/" + MediaPathToken("/mnt/usb/a.mp3") + ".mp3"},
+        {"", "/mnt/usb/\x01\x0f.ogg", base + "ipod/" + MediaPathToken("/mnt/usb/\x01\x0f.ogg") + ".ogg"},
         {"", "/music/Artist/01 Song.FLAC", base + token + ".flac"},
         {"", "/music/notes.xyz", base + token + ".txt"},
         {"", "/mnt/usb2/a.mp3", base + token + ".mp3"},  // the USB root by whole components
-        {"admin_port=8080\nnet_card1_address=10.9.8.7\nusb_mount_root=/\n", "/a", base + "ipod/2f61.txt"},
+        {"admin_port=8080\nnet_card1_address=10.9.8.7\nusb_mount_root=/\n", "/a", base + "ipod/" + MediaPathToken("/a") + ".txt"},
         {"net_card1_address=10.1.1.1\n", "/m/x.mp3", "http://10.1.1.1/audio/webUI/audiotransfer.cgi/" + token + ".mp3"},
     };
     std::string url;
@@ -400,6 +400,11 @@ TEST_F(UpnpPlayerTest, SongUrlsForStreamsLibraryAndUsbSongs)
         ASSERT_EQ(0, player->BuildSongUrl(&info, url)) << c.path;
         EXPECT_EQ(c.url, url);
     }
+    // A song queued by path has no library id: it goes by a path token.
+    TARN_MEDIA_INFO byPath = tarntest::MakeMediaInfo("/m/x.mp3", "", "");
+    byPath.id = 0;
+    ASSERT_EQ(0, player->BuildSongUrl(&byPath, url));
+    EXPECT_EQ("http://10.1.1.1/audio/webUI/audiotransfer.cgi/ipod/" + MediaPathToken("/m/x.mp3") + ".mp3", url);
     EXPECT_EQ(-1, player->BuildSongUrl(nullptr, url));
 }
 

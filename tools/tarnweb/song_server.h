@@ -4,9 +4,10 @@
 //   GET|HEAD /audio/webUI/audiotransfer.cgi/<token>.<ext>
 //       <token> is the song-id token (platform/media_id.h); the song's file
 //       is looked up in the media library by id.
-//   GET|HEAD /audio/webUI/audiotransfer.cgi/ipod/<hex path>.<ext>
-//       <hex path> is the file path, two hex digits per byte; only regular
-//       files below the USB mount root (after resolving links) are served.
+//   GET|HEAD /audio/webUI/audiotransfer.cgi/ipod/<path token>.<ext>
+//       <path token> names the file and is signed with the installation's
+//       secret (MediaPathToken, platform/media_id.h): songs on USB volumes
+//       and songs queued by path. Anything else gets 404.
 //
 // Files are streamed from disk in chunks, with byte ranges (206, and 416 for
 // a range past the end), the type's MIME type and the DLNA streaming headers.
