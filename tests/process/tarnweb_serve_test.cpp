@@ -2,6 +2,12 @@
 // byte ranges, HEAD and refusals.
 #include <gtest/gtest.h>
 
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
 #include <curl/curl.h>
 
 #include "platform/media_id.h"
@@ -10,6 +16,7 @@
 namespace {
 
 const char kBase[] = "http://127.0.0.1:18080/audio/webUI/audiotransfer.cgi/";
+const char *g_from = "127.0.0.1";  // the address requests come from
 
 size_t Append(char *data, size_t size, size_t n, void *out)
 {
@@ -46,6 +53,7 @@ Reply Fetch(const std::string &url, const std::string &range = "", bool head = f
     curl_easy_setopt(c, CURLOPT_NOPROXY, "*");
     curl_easy_setopt(c, CURLOPT_RANGE, range.empty() ? nullptr : range.c_str());
     curl_easy_setopt(c, CURLOPT_NOBODY, head ? 1L : 0L);
+    curl_easy_setopt(c, CURLOPT_INTERFACE, g_from);
     curl_easy_perform(c);  // a failed transfer leaves status 0
     curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &r.status);
     curl_easy_cleanup(c);
@@ -161,6 +169,105 @@ TEST_F(TarnwebTest, OnlySignedTokensNameAFile)
     EXPECT_EQ(small, r.body);
     ASSERT_EQ(0, h.WriteFile("/elsewhere/by-path.mp3", "abc"));
     EXPECT_EQ("abc", Fetch(UsbUrl(h.Path("/elsewhere/by-path.mp3"))).body);
+}
+
+TEST_F(TarnwebTest, OverlappingRangesAreSentOnce)
+{
+    const std::string url = UsbUrl(usb + "/disk1/sub/song.mp3");
+    Reply same = Fetch(url, "0-299999,0-299999,0-299999,0-299999,0-299999,0-299999,0-299999,0-299999");
+    EXPECT_EQ(200, same.status);
+    EXPECT_EQ(small, same.body);
+    Reply joined = Fetch(url, "0-99,50-149,150-199");
+    EXPECT_EQ(206, joined.status);
+    EXPECT_EQ("bytes 0-199/300000", joined.Header("content-range"));
+    EXPECT_EQ(small.substr(0, 200), joined.body);
+    Reply two = Fetch(url, "10-19,100-109,15-17");  // two pieces after merging
+    EXPECT_EQ(206, two.status);
+    EXPECT_NE(std::string::npos, two.Header("content-type").find("multipart/byteranges"));
+    EXPECT_NE(std::string::npos, two.body.find(small.substr(10, 10)));
+    EXPECT_NE(std::string::npos, two.body.find(small.substr(100, 10)));
+    EXPECT_LT(two.body.size(), 1000u);
+}
+
+// A connection from `from` (a loopback address) to the server; -1 on failure.
+int ConnectFrom(const char *from, int receiveBuffer = 0)
+{
+    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0)
+        return -1;
+    if (receiveBuffer > 0)
+        setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &receiveBuffer, sizeof(receiveBuffer));
+    struct sockaddr_in a = {};
+    a.sin_family = AF_INET;
+    inet_pton(AF_INET, from, &a.sin_addr);
+    struct sockaddr_in to = {};
+    to.sin_family = AF_INET;
+    to.sin_port = htons(18080);
+    inet_pton(AF_INET, "127.0.0.1", &to.sin_addr);
+    if (bind(fd, reinterpret_cast<sockaddr *>(&a), sizeof(a)) != 0 ||
+        connect(fd, reinterpret_cast<sockaddr *>(&to), sizeof(to)) != 0) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+// True while the server has not closed fd (nothing to read, no end of file).
+bool StillOpen(int fd)
+{
+    char c;
+    ssize_t n = recv(fd, &c, 1, MSG_DONTWAIT | MSG_PEEK);
+    return n < 0 && errno == EAGAIN;
+}
+
+// Silent connections from many addresses and clients that ask for a big
+// song and never read do not keep a renderer from its song: silent ones
+// wait without a worker, and one address holds at most its share.
+TEST_F(TarnwebTest, SilentAndSlowClientsDoNotStarveOthers)
+{
+    EXPECT_EQ(0, tarnwebtest::EndChild(h, server));
+    server = tarnwebtest::StartSongServer(h, {"--bind", "127.0.0.1", "--threads", "6",
+                                              "--max-per-client", "4"});
+    ASSERT_GT(server, 0);
+    ASSERT_EQ(0, h.WriteFile("/media/usb/disk1/big.mp3", ""));
+    ASSERT_EQ(0, truncate(h.Path("/media/usb/disk1/big.mp3").c_str(), 64 << 20));
+    std::vector<int> silent, slow;
+    for (int i = 0; i < 200; ++i) {
+        std::string from = "127.0.1." + std::to_string(i + 1);
+        int fd = ConnectFrom(from.c_str());
+        ASSERT_GE(fd, 0) << from;
+        silent.push_back(fd);
+    }
+    std::string big = UsbUrl(usb + "/disk1/big.mp3");
+    std::string request = "GET " + big.substr(big.find("/audio")) + " HTTP/1.1\r\nHost: x\r\n\r\n";
+    for (int i = 0; i < 8; ++i) {
+        int fd = ConnectFrom("127.0.2.1", 4096);
+        ASSERT_GE(fd, 0);
+        ASSERT_EQ(static_cast<ssize_t>(request.size()), send(fd, request.data(), request.size(), MSG_NOSIGNAL));
+        slow.push_back(fd);
+    }
+    usleep(300 * 1000);  // the slow ones' workers fill their buffers and block
+    // A renderer still gets its songs, several times over.
+    for (int i = 0; i < 3; ++i) {
+        Reply r = Fetch(kBase + MediaIDEncryption(songs[i].id) + ".mp3");
+        EXPECT_EQ(200, r.status) << i;
+        EXPECT_TRUE(tarnwebtest::ReadAll(songs[i].path) == r.body) << i;
+    }
+    int open = 0;
+    for (int fd : silent)
+        open += StillOpen(fd) ? 1 : 0;
+    EXPECT_EQ(200, open) << "silent connections are kept until their deadline";
+    EXPECT_EQ(1, h.CountLog("Too many connections from 127.0.2.1")) << h.Log();
+    // The address over its share can fetch again once its connections end.
+    for (int fd : slow)
+        close(fd);
+    usleep(300 * 1000);
+    g_from = "127.0.2.1";
+    Reply again = Fetch(UsbUrl(usb + "/disk1/sub/song.mp3"), "0-9");
+    g_from = "127.0.0.1";
+    EXPECT_EQ(206, again.status);
+    for (int fd : silent)
+        close(fd);
 }
 
 }  // namespace

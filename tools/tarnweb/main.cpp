@@ -1,7 +1,7 @@
 // tarnweb: serves the songs that the daemon hands to UPnP renderers.
 //
-//   tarnweb [--port N] [--bind ADDR] [--threads N] [--db FILE]
-//           [--usb-root DIR] [--write-timeout SEC] [--access-log FILE]
+//   tarnweb [--port N] [--bind ADDR] [--threads N] [--max-per-client N] [--db FILE]
+//           [--write-timeout SEC] [--access-log FILE]
 //           [--verbose]
 //
 // The port defaults to "admin_port" of /etc/tarninfo.conf, the port the
@@ -30,13 +30,12 @@ void Usage(FILE *out)
 {
     fprintf(out,
             "usage: tarnweb [--port N] [--bind ADDR] [--threads N] [--db FILE]\n"
-            "               [--usb-root DIR] [--write-timeout SEC] [--verbose]\n"
+            "               [--write-timeout SEC] [--access-log FILE] [--verbose]\n"
             "  --port N          port to listen on (default: admin_port of %s; 0: any)\n"
             "  --bind ADDR       address to listen on (default 0.0.0.0)\n"
-            "  --threads N       connections served at once (default 8)\n"
+            "  --threads N       requests served at once (default 32)\n"
+            "  --max-per-client N connections of one client address at once (default 8)\n"
             "  --db FILE         media library database (default %s)\n"
-            "  --usb-root DIR    only files below DIR are served by path\n"
-            "                    (default: usb_mount_root of the configuration, or /media/usb)\n"
             "  --write-timeout S drop a client that takes nothing for S seconds (default 60)\n"
             "  --access-log FILE append one line per song request to FILE\n"
             "  --verbose         one line per request on standard error\n",
@@ -80,14 +79,14 @@ int main(int argc, char **argv)
             options.bindAddress = value;
         } else if (a == "--threads") {
             ok = ParseInt(value, 1, 256, &options.threads);
+        } else if (a == "--max-per-client") {
+            ok = ParseInt(value, 1, 4096, &options.perClient);
         } else if (a == "--write-timeout") {
             ok = ParseInt(value, 1, 3600, &options.writeTimeoutSec);
         } else if (a == "--db") {
             options.dbPath = value;
         } else if (a == "--access-log") {
             options.accessLog = value;
-        } else if (a == "--usb-root") {
-            options.usbRoot = value;
         } else {
             fprintf(stderr, "tarnweb: unknown option %s (see --help)\n", a.c_str());
             return 2;

@@ -1,7 +1,6 @@
 #include "tools/tarnweb/song_server.h"
 
 #include <fcntl.h>
-#include <limits.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -17,6 +16,7 @@
 #include "platform/medialib.h"
 #include "platform/tarn_log.h"
 #include "platform/tarn_media_types.h"
+#include "tools/tarnweb/guarded_server.h"
 
 static const char kLogUnit[] = "tarnweb";
 
@@ -24,6 +24,7 @@ namespace {
 
 const size_t kChunk = 64 * 1024;
 const size_t kMaxRanges = 8;
+const int kBacklog = 1024;  // connections waiting to be accepted
 // DLNA: streaming transfer, background transfer, connection stalling, DLNA 1.5.
 const char kDlnaFlags[] = "DLNA.ORG_OP=01;DLNA.ORG_CI=0;DLNA.ORG_FLAGS=01700000000000000000000000000000";
 
@@ -90,10 +91,22 @@ bool NormalizeRanges(httplib::Ranges &ranges, uint64_t size)
     }
     if (good.empty())
         return false;
-    // Too many pieces: answer with the whole file instead.
-    if (good.size() > kMaxRanges)
-        good.clear();
-    ranges = good;
+    // Overlapping and touching ranges are sent once: a request for the same
+    // bytes many times over gets them once.
+    std::sort(good.begin(), good.end());
+    httplib::Ranges merged;
+    for (const httplib::Range &r : good) {
+        if (!merged.empty() && r.first <= merged.back().second + 1)
+            merged.back().second = std::max(merged.back().second, r.second);
+        else
+            merged.push_back(r);
+    }
+    // Too many pieces, or the whole file anyway: answer with the whole file.
+    if (merged.size() > kMaxRanges ||
+        (merged.size() == 1 && merged[0].first == 0 &&
+         static_cast<uint64_t>(merged[0].second) + 1 == size && ranges.size() > 1))
+        merged.clear();
+    ranges = merged;
     return true;
 }
 
@@ -113,79 +126,25 @@ void NotFound(const httplib::Request &req, httplib::Response &res)
 
 }  // namespace
 
-int SongServerDecodeHex(const std::string &hex, std::string *out)
+namespace {
+
+GuardLimits LimitsOf(const SongServerOptions &options)
 {
-    if (!out || hex.empty() || hex.size() % 2 != 0)
-        return -1;
-    std::string path;
-    path.reserve(hex.size() / 2);
-    for (size_t i = 0; i < hex.size(); i += 2) {
-        int v = 0;
-        for (size_t k = i; k < i + 2; ++k) {
-            char c = hex[k];
-            int d;
-            if (c >= '0' && c <= '9')
-                d = c - '0';
-            else if (c >= 'a' && c <= 'f')
-                d = c - 'a' + 10;
-            else if (c >= 'A' && c <= 'F')
-                d = c - 'A' + 10;
-            else
-                return -1;
-            v = v * 16 + d;
-        }
-        if (v == 0)
-            return -1;
-        path += static_cast<char>(v);
-    }
-    *out = path;
-    return 0;
+    GuardLimits limits;
+    limits.workers = options.threads;
+    limits.perClient = options.perClient;
+    return limits;
 }
 
-int SongServerResolveInside(const std::string &path, const std::string &root,
-                            std::string *resolved)
-{
-    if (!resolved || path.empty() || path[0] != '/' || root.empty())
-        return -1;
-    // Refuse any ".." component outright, even when it would stay inside.
-    size_t start = 0;
-    while (start <= path.size()) {
-        size_t end = path.find('/', start);
-        if (end == std::string::npos)
-            end = path.size();
-        if (path.compare(start, end - start, "..") == 0 && end - start == 2)
-            return -1;
-        start = end + 1;
-    }
-    char rootReal[PATH_MAX];
-    char fileReal[PATH_MAX];
-    if (!realpath(root.c_str(), rootReal) || !realpath(path.c_str(), fileReal))
-        return -1;
-    size_t n = strlen(rootReal);
-    bool inside;
-    if (strcmp(rootReal, "/") == 0)
-        inside = true;
-    else
-        inside = strncmp(fileReal, rootReal, n) == 0 && fileReal[n] == '/';
-    if (!inside)
-        return -1;
-    *resolved = fileReal;
-    return 0;
-}
+}  // namespace
 
-SongServer::SongServer(const SongServerOptions &opts) : options(opts), server(new httplib::Server)
+SongServer::SongServer(const SongServerOptions &opts)
+    : options(opts), server(new GuardedServer(LimitsOf(opts)))
 {
-    if (options.usbRoot.empty()) {
-        char root[4096];
-        if (TARNAudioUSBMountRoot(root, sizeof(root)) == 0)
-            options.usbRoot = root;
-    }
     if (options.dbPath.empty())
         options.dbPath = MediaLibDefaultPath();
     if (options.threads < 1)
         options.threads = 1;
-    int threads = options.threads;
-    server->new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
     server->set_write_timeout(options.writeTimeoutSec, 0);
     server->set_read_timeout(10, 0);
     server->set_keep_alive_timeout(5);
@@ -233,7 +192,7 @@ SongServer::SongServer(const SongServerOptions &opts) : options(opts), server(ne
                 return;
             }
         }
-        ServeFile(req, res, path, ext, usb);
+        ServeFile(req, res, path, ext);
     };
     server->Get(R"(/audio/webUI/audiotransfer\.cgi/ipod/([^/]+))",
                 [serve](const httplib::Request &req, httplib::Response &res) { serve(req, res, true); });
@@ -295,7 +254,7 @@ int SongServer::LookupSong(uint32_t id, std::string *path)
 }
 
 void SongServer::ServeFile(const httplib::Request &req, httplib::Response &res,
-                           const std::string &path, const std::string &urlExt, bool usb)
+                           const std::string &path, const std::string &urlExt)
 {
     int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
     if (fd < 0) {
@@ -347,11 +306,14 @@ void SongServer::ServeFile(const httplib::Request &req, httplib::Response &res,
 
 int SongServer::Bind()
 {
-    if (options.port == 0)
-        return server->bind_to_any_port(options.bindAddress);
-    if (!server->bind_to_port(options.bindAddress, options.port))
-        return -1;
-    return options.port;
+    int port = options.port;
+    if (port == 0)
+        port = server->bind_to_any_port(options.bindAddress);
+    else if (!server->bind_to_port(options.bindAddress, port))
+        port = -1;
+    if (port > 0)
+        server->SetBacklog(kBacklog);
+    return port;
 }
 
 int SongServer::Serve()

@@ -19,8 +19,8 @@
 #include <mutex>
 #include <string>
 
+class GuardedServer;
 namespace httplib {
-class Server;
 struct Request;
 struct Response;
 }
@@ -29,10 +29,10 @@ class MediaLib;
 struct SongServerOptions {
     std::string bindAddress = "0.0.0.0";
     int port = 0;              // 0: any free port
-    int threads = 8;           // worker threads (connections served at once)
+    int threads = 32;          // worker threads (requests served at once)
+    int perClient = 8;         // connections of one client address at once
     int writeTimeoutSec = 60;  // a client that reads nothing for this long is dropped
     std::string dbPath;        // media library database
-    std::string usbRoot;       // "" -> TARNAudioUSBMountRoot()
     bool verbose = false;      // one line per request on stderr
     std::string accessLog;     // file that gets one line per song request ("" none)
 };
@@ -53,25 +53,15 @@ public:
 private:
     int LookupSong(uint32_t id, std::string *path);
     void ServeFile(const httplib::Request &req, httplib::Response &res, const std::string &path,
-                   const std::string &urlExt, bool usb);
+                   const std::string &urlExt);
 
     void LogAccess(const httplib::Request &req);
 
     SongServerOptions options;
     int accessFd = -1;
-    std::unique_ptr<httplib::Server> server;
+    std::unique_ptr<GuardedServer> server;
     std::mutex libraryMutex;
     std::unique_ptr<MediaLib> library;
 };
-
-// Decodes the hex text of a path (two digits per byte). 0, or -1 for an odd
-// length, a non-hex digit or a NUL byte.
-int SongServerDecodeHex(const std::string &hex, std::string *out);
-
-// Resolves path (links included) and checks that it lies inside root (also
-// resolved). 0 with the resolved path, -1 when it does not exist, has a ".."
-// component or lies outside root.
-int SongServerResolveInside(const std::string &path, const std::string &root,
-                            std::string *resolved);
 
 #endif
