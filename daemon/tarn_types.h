@@ -6,6 +6,8 @@
 #include <cstddef>
 #include <cstdint>
 
+#include "platform/tarn_env.h"  // the fixed paths
+
 // ---------------------------------------------------------------------------
 // Song record of the media library (7336 bytes, host byte order).
 struct TARN_MEDIA_INFO {
@@ -164,12 +166,5 @@ enum {
     PLAYER_STATE_ENDED = 5,
 };
 
-// Fixed paths (placed under TARN_ROOT by TarnPath()).
-#define TARN_CTRL_SOCKET "/tmp/tarnaudiod.sock"
-#define TARN_MPLAYER_SOCKET "/tmp/mplayer.sock"
-#define TARN_PID_FILE "/var/run/tarnaudiod.pid"
-#define TARN_MPLAYER_PID_FILE "/var/run/mplayer.daemon.pid"
-#define TARN_MPLAYER_BIN "/usr/tarn/bin/mplayer-daemon"
-#define TARN_INFO_CONF "/etc/tarninfo.conf"
 
 #endif

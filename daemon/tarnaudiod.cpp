@@ -123,14 +123,14 @@ std::string ReplyText(const Json::Value &reply)
 
 }  // namespace
 
-// The reply with as many whole queue entries as fit CTRL_REPLY_SIZE - 1
-// characters. Each entry's share is estimated from its own text (its lines
+// The reply with as many whole entries of its array `key` (a queue page's
+// "uris", a device list's "list") as fit CTRL_REPLY_SIZE - 1 characters. Each entry's share is estimated from its own text (its lines
 // sit two levels deeper in the reply); the result is checked and, in the rare
 // case the estimate was short, cut further.
-static std::string CutQueuePage(const Json::Value &reply)
+static std::string CutPage(const Json::Value &reply, const char *key)
 {
     Json::Value page = reply;
-    Json::Value &uris = page["uris"];
+    Json::Value &uris = page[key];
     Json::Value all = uris;
     uris = Json::Value(Json::arrayValue);
     size_t used = ReplyText(page).size();
@@ -155,11 +155,14 @@ static std::string CutQueuePage(const Json::Value &reply)
 void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE])
 {
     std::string text = ReplyText(reply);
-    // A queue page that does not fit is cut by whole entries from its end, so
-    // that the reply stays valid JSON; "total" still tells the whole length.
-    if (text.size() >= CTRL_REPLY_SIZE && reply.isObject() && reply["uris"].isArray() &&
-        reply["uris"].size() > 0)
-        text = CutQueuePage(reply);
+    // A queue page or device list that does not fit is cut by whole entries
+    // from its end, so that the reply stays valid JSON; "total" still tells
+    // the whole length.
+    for (const char *key : {"uris", "list"}) {
+        if (text.size() >= CTRL_REPLY_SIZE && reply.isObject() && reply.isMember(key) &&
+            reply[key].isArray() && reply[key].size() > 0)
+            text = CutPage(reply, key);
+    }
     memset(buffer, 0, CTRL_REPLY_SIZE);
     snprintf(buffer, CTRL_REPLY_SIZE, "%s", text.c_str());
 }

@@ -13,6 +13,14 @@
 
 #include <string>
 
+// Fixed paths (placed under TARN_ROOT by TarnPath()).
+#define TARN_CTRL_SOCKET "/tmp/tarnaudiod.sock"
+#define TARN_MPLAYER_SOCKET "/tmp/mplayer.sock"
+#define TARN_PID_FILE "/var/run/tarnaudiod.pid"
+#define TARN_MPLAYER_PID_FILE "/var/run/mplayer.daemon.pid"
+#define TARN_MPLAYER_BIN "/usr/tarn/bin/mplayer-daemon"
+#define TARN_INFO_CONF "/etc/tarninfo.conf"
+
 // The fixed path placed under TARN_ROOT when that is set ("/tmp/x" ->
 // "<root>/tmp/x"); unchanged otherwise.
 std::string TarnPath(const char *fixedPath);

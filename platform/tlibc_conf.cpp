@@ -1,5 +1,7 @@
 #include "platform/tlibc_conf.h"
 
+#include "platform/tarn_env.h"
+
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
@@ -344,4 +346,15 @@ int TLIBCStrSep(const char *text, const char *separators, TLIBC_SZLIST **list)
             ++p;
     }
     return added;
+}
+
+unsigned long TarnConfNumber(const char *key, unsigned long fallback)
+{
+    char value[32];
+    std::string conf = TarnPath(TARN_INFO_CONF);
+    if (TLIBCFileGetKeyValue(conf.c_str(), key, value, sizeof(value), 0) <= 0)
+        return fallback;
+    char *end = nullptr;
+    long n = strtol(value, &end, 10);
+    return n > 0 && end != value ? static_cast<unsigned long>(n) : fallback;
 }

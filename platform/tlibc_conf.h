@@ -58,4 +58,9 @@ void TLIBCSzListFree(TLIBC_SZLIST *list);
 // added, or -1 on a bad argument or allocation failure.
 int TLIBCStrSep(const char *text, const char *separators, TLIBC_SZLIST **list);
 
+// A positive number from key of the system's configuration file
+// (TARN_INFO_CONF), or fallback when the key is absent, empty, not a number
+// or not positive. The file is read at each call.
+unsigned long TarnConfNumber(const char *key, unsigned long fallback);
+
 #endif

@@ -139,25 +139,14 @@ void NormalizeBitrates(Json::Value &list)
     }
 }
 
-// A positive number from key of the configuration file, or fallback.
-static unsigned long ConfNumber(const char *key, unsigned long fallback)
-{
-    char value[32];
-    std::string conf = TarnPath(TARN_INFO_CONF);
-    if (TLIBCFileGetKeyValue(conf.c_str(), key, value, sizeof(value), 0) <= 0)
-        return fallback;
-    long n = strtol(value, nullptr, 10);
-    return n > 0 ? static_cast<unsigned long>(n) : fallback;
-}
-
 size_t RadioListMaxBytes()
 {
-    return ConfNumber("radio_list_max_bytes", RADIO_LIST_DEFAULT_MAX_BYTES);
+    return TarnConfNumber("radio_list_max_bytes", RADIO_LIST_DEFAULT_MAX_BYTES);
 }
 
 unsigned RadioListMaxStations()
 {
-    return static_cast<unsigned>(ConfNumber("radio_list_max_stations", RADIO_LIST_DEFAULT_MAX_STATIONS));
+    return static_cast<unsigned>(TarnConfNumber("radio_list_max_stations", RADIO_LIST_DEFAULT_MAX_STATIONS));
 }
 
 namespace {

@@ -12,12 +12,14 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <strings.h>
 
 #include <curl/curl.h>
 
 
 #include "platform/tarn_log.h"
+#include "platform/tlibc_conf.h"
 #include "upnp/get_capability.h"
 #include "upnp/xml_util.h"
 
@@ -32,6 +34,27 @@ static const int kSearchMx = 1800;
 static const int kSubscribeTimeout = 1800;
 static const int kMaxContentLength = 32000;
 static const uint32_t kNoRenderer = static_cast<uint32_t>(-1);
+// Devices listed of each kind at most ("upnp_devices_max", read once): a
+// LAN that announces more, or a host that announces made-up devices, cannot
+// grow the daemon without end.
+static const unsigned long kListMaxDefault = 256;
+
+// True when a list of that size takes no more devices; logged at most once
+// a minute. Called under the controller's lock.
+static bool ListFull(size_t size, const char *kind, const std::string &udn)
+{
+    static const size_t max = TarnConfNumber("upnp_devices_max", kListMaxDefault);
+    static time_t lastLog = 0;
+    if (size < max)
+        return false;
+    time_t now = time(nullptr);
+    if (now - lastLog >= 60) {
+        lastLog = now;
+        TLOG("Too many %s listed (%zu, upnp_devices_max): [%.64s] and later ones left out", kind,
+             size, udn.c_str());
+    }
+    return true;
+}
 
 // Locks the controller's mutex for one scope.
 namespace {
@@ -441,7 +464,7 @@ void UpnpController::AddServer(IXML_Document *doc, const char *location)
     ixmlNodeList_free(services);
 
     ScopedLock lock(this);
-    if (FindServerByUdn(server->udn) >= 0) {
+    if (FindServerByUdn(server->udn) >= 0 || ListFull(servers.size(), "servers", server->udn)) {
         delete server;
         return;
     }
@@ -467,7 +490,8 @@ void UpnpController::AddRenderer(IXML_Document *doc, const char *location)
     {
         // Every announcement comes here; a listed renderer is not probed again.
         ScopedLock lock(this);
-        if (FindRendererByUdn(renderer->udn) >= 0) {
+        if (FindRendererByUdn(renderer->udn) >= 0 ||
+            ListFull(renderers.size(), "renderers", renderer->udn)) {
             delete renderer;
             return;
         }
@@ -518,7 +542,8 @@ void UpnpController::AddRenderer(IXML_Document *doc, const char *location)
     {
         ScopedLock lock(this);
         // Another announcement of the same renderer may have won meanwhile.
-        if (FindRendererByUdn(renderer->udn) >= 0) {
+        if (FindRendererByUdn(renderer->udn) >= 0 ||
+            ListFull(renderers.size(), "renderers", renderer->udn)) {
             delete renderer;
             return;
         }

@@ -100,6 +100,20 @@ std::string ReadUntilClosed(int fd, long end)
 
 }  // namespace
 
+long ResidentKiB(pid_t pid)
+{
+    FILE *f = fopen(("/proc/" + std::to_string(pid) + "/status").c_str(), "r");
+    if (f == nullptr)
+        return -1;
+    char line[256];
+    long kib = -1;
+    while (kib < 0 && fgets(line, sizeof(line), f) != nullptr)
+        if (sscanf(line, "VmRSS: %ld kB", &kib) != 1)
+            kib = -1;
+    fclose(f);
+    return kib;
+}
+
 bool InPrivateNetns()
 {
     std::error_code e1, e2;

@@ -23,6 +23,8 @@ namespace tarntest {
 
 // True outside the machine's own network namespace (or TARN_IN_NETNS=1).
 bool InPrivateNetns();
+// The resident memory of a process in KiB (VmRSS of /proc), or -1.
+long ResidentKiB(pid_t pid);
 inline std::string BinPath(const char *name) { return std::string(TARN_BIN_DIR) + "/" + name; }
 inline std::string SourcePath(const char *rel) { return std::string(TARN_SOURCE_DIR) + "/" + rel; }
 // A song record; the title defaults to the file name without extension.

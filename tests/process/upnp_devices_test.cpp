@@ -3,6 +3,7 @@
 // misbehaving devices: bad descriptions and events, garbage on its ports.
 #include <gtest/gtest.h>
 
+#include <arpa/inet.h>
 #include <json/json.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -249,6 +250,93 @@ TEST_F(UpnpDevices, HostileDevicesNeitherCrashNorSilenceTheDaemon)
     auto t0 = std::chrono::steady_clock::now();
     EXPECT_EQ(0, h.Stop());
     EXPECT_LT(std::chrono::duration<double>(std::chrono::steady_clock::now() - t0).count(), 5.0);
+}
+
+// A LAN that announces more devices than the daemon lists, and a flood of
+// event messages that match no subscription, stop half-way or are not HTTP:
+// the daemon lists at most its limit, keeps answering, and its memory stays
+// bounded.
+TEST_F(UpnpDevices, FloodsOfDevicesAndEventsKeepTheDaemonAnswering)
+{
+    const int kDevices = 60, kListMax = 40;
+    EXPECT_EQ(0, h.Stop());
+    ASSERT_EQ(0, h.WriteFile("/etc/tarninfo.conf", "upnp_devices_max=" + std::to_string(kListMax) + "\n"));
+    ASSERT_EQ(0, h.Start()) << h.Error();
+    daemonIp = fakedev::ListeningAddress(49152);
+    std::atomic<long> slowestUs{0};
+    clientRunning = true;
+    client = std::thread([this, &slowestUs] {
+        for (std::string reply; clientRunning; std::this_thread::sleep_for(std::chrono::milliseconds(20))) {
+            auto t0 = std::chrono::steady_clock::now();
+            if (h.Request(ACT_GET_STATUS, "", &reply, 3000) != 0)
+                ++unanswered;
+            ++requests;
+            long us = static_cast<long>(std::chrono::duration_cast<std::chrono::microseconds>(
+                                            std::chrono::steady_clock::now() - t0).count());
+            if (us > slowestUs)
+                slowestUs = us;
+        }
+    });
+    long rssBefore = tarntest::ResidentKiB(h.Pid());
+    fakedev::FakeHttpServer lan;
+    ASSERT_GT(lan.Start(daemonIp.c_str()), 0);
+    lan.SetRoute("/A/scpd.xml", {fakedev::AvtScpd()});
+    lan.SetRoute("/R/scpd.xml", {fakedev::RcsScpd()});
+    auto url = [&lan](int i) { return lan.BaseUrl() + "/d" + std::to_string(i) + ".xml"; };
+    for (int i = 1; i <= kDevices; ++i)
+        lan.SetRoute("/d" + std::to_string(i) + ".xml",
+                     {fakedev::DeviceDescription(Uuid(1000 + i), "Flood " + std::to_string(i), {{kAvt, "A"}, {kRcs, "R"}})});
+    auto listed = [this] { return Ask(ACT_LIST_RENDERERS, "0 1")["total"].asInt(); };
+    for (int round = 0; round < 3 && listed() < kListMax; ++round) {
+        for (int i = 1; i <= kDevices; ++i)
+            fakedev::AnnounceService(daemonIp, true, Uuid(1000 + i), kAvt, url(i));
+        WaitUntil([&] { return listed() >= kListMax; }, 20000);
+    }
+    // Announced again: the full list takes none of the rest.
+    for (int i = kDevices; i >= 1; --i)
+        fakedev::AnnounceService(daemonIp, true, Uuid(1000 + i), kAvt, url(i));
+    std::this_thread::sleep_for(std::chrono::milliseconds(1000));
+    EXPECT_EQ(kListMax, listed());
+    EXPECT_TRUE(h.WaitLog("Too many renderers listed", 1000)) << h.Log();
+    // The whole list does not fit one reply: it comes cut by whole entries.
+    Json::Value all = Ask(ACT_LIST_RENDERERS, "0 0");
+    EXPECT_EQ(kListMax, all["total"].asInt());
+    EXPECT_GT(all["list"].size(), 10u);
+    EXPECT_LT(all["list"].size(), static_cast<unsigned>(kListMax));
+
+    // Event messages sent without waiting for an answer.
+    auto sendAndGo = [this](const std::string &bytes) {
+        int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_in to{};
+        to.sin_family = AF_INET;
+        to.sin_port = htons(49152);
+        inet_pton(AF_INET, daemonIp.c_str(), &to.sin_addr);
+        if (connect(fd, reinterpret_cast<sockaddr *>(&to), sizeof(to)) == 0)
+            fakedev::SendAll(fd, bytes);
+        close(fd);
+    };
+    for (int i = 0; i < 1500; ++i) {
+        std::string sid = "uuid:flood-" + std::to_string(i);
+        std::string body = fakedev::LastChangeEvent(std::string(200, '<'));
+        if (i % 3 == 0)
+            sendAndGo("NOTIFY / HTTP/1.1\r\nNT: upnp:event\r\nNTS: upnp:propchange\r\nSID: " + sid +
+                      "\r\nSEQ: 0\r\nCONTENT-LENGTH: " + std::to_string(body.size()) + "\r\n\r\n" + body);
+        else if (i % 3 == 1)
+            sendAndGo("NOTIFY / HTTP/1.1\r\nSID: " + sid + "\r\nCONTENT-LENGTH: 50000\r\n\r\n<e:");
+        else
+            sendAndGo(std::string(3000, static_cast<char>(i)));
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(500));
+    clientRunning = false;
+    client.join();
+    long rssAfter = tarntest::ResidentKiB(h.Pid());
+    printf("flood: %d requests, slowest answer %.1f ms, resident %ld -> %ld KiB\n", requests.load(),
+           slowestUs.load() / 1000.0, rssBefore, rssAfter);
+    EXPECT_GT(requests.load(), 20);
+    EXPECT_EQ(0, unanswered.load()) << "of " << requests.load() << " requests";
+    EXPECT_GT(rssBefore, 0);
+    EXPECT_LT(rssAfter - rssBefore, 32 * 1024) << "KiB";
+    EXPECT_EQ(kListMax, listed());
 }
 
 }  // namespace
