@@ -168,7 +168,7 @@ std::string Field(const Snapshot &s, const std::string &name, bool *known)
     *known = true;
     bool stream = !s.station.empty();
     if (name == "title")
-        return stream ? s.streamTitle : (s.state == kStopped && s.uri.empty() ? SongTitle(s.song) : SongTitle(s.song));
+        return stream ? s.streamTitle : SongTitle(s.song);
     if (name == "artist")
         return stream ? s.station : s.song.get("artist", "").asString();
     if (name == "album")
@@ -1606,18 +1606,10 @@ int CmdWatch(const Command &c, Args &a)
         }
         Seen s = Look(seg);
         if (total < 0 || s.changed != last.changed || s.index != last.index || s.uri != last.uri) {
+            // The queue's length, for "#3/12"; a page of one entry is enough.
             Json::Value q;
-            std::string text;
-            if (Send(MakeRequest(ACT_QUEUE_LIST, "0 0"), &text) == 0) {
-                Json::CharReaderBuilder b;
-                std::string errs;
-                std::unique_ptr<Json::CharReader> reader(b.newCharReader());
-                std::string small = text;
-                Json::Value v;
-                // Only the header matters; a long queue's page may be cut.
-                size_t at = small.find("\"total\"");
-                total = at != std::string::npos ? atoi(small.c_str() + small.find(':', at) + 1) : 0;
-            }
+            if (Request(ACT_QUEUE_LIST, "0 1", &q) == 0)
+                total = JsonInt(q, "total");
             last = s;
         }
         std::string line = WatchLine(s, seg, total, cols);
