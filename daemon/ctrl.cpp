@@ -19,12 +19,6 @@ static const char kInfoUnit[] = "info";
 
 namespace {
 
-// Waits at most 0.5 s for the reply; a signal does not cut the wait short.
-int WaitReadable(int fd)
-{
-    return SocketWaitReady(fd, false, 500000);
-}
-
 // A request with the action and, when format is given, the parameter text.
 void Fill(ControlRequest *request, int action)
 {
@@ -66,17 +60,30 @@ int SendPage(int action, int start, int limit, char *reply, int replySize)
 
 int CtrlConnect()
 {
-    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
-    if (fd < 0)
+    return CtrlConnectWhy(nullptr);
+}
+
+int CtrlConnectWhy(int *error)
+{
+    if (error)
+        *error = 0;
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0) {
+        if (error)
+            *error = errno;
         return fd;
+    }
     std::string path = TarnPath(TARN_CTRL_SOCKET);
     struct sockaddr_un addr;
     memset(&addr, 0, sizeof(addr));
     addr.sun_family = AF_UNIX;
     snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", path.c_str());
     if (connect(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) == -1) {
+        int err = errno;
         TarnLog("%s:%d Failed to connect to %s. [%m]", kCtrlUnit, 27, path.c_str());
         close(fd);
+        if (error)
+            *error = err;
         return -1;
     }
     return fd;
@@ -84,20 +91,33 @@ int CtrlConnect()
 
 int CtrlSendRequest(const ControlRequest *request, char *reply, int replySize)
 {
+    return CtrlSendRequestTimed(request, reply, replySize, 500, nullptr);
+}
+
+int CtrlSendRequestTimed(const ControlRequest *request, char *reply, int replySize, int timeoutMs,
+                         int *error)
+{
+    int unused = 0;
+    if (!error)
+        error = &unused;
+    *error = 0;
     if (!reply || replySize <= 0 || !request) {
         TarnLog("%s:%d Bad parameter", kCtrlUnit, 45);
+        *error = EINVAL;
         return -1;
     }
-    int fd = CtrlConnect();
+    int fd = CtrlConnectWhy(error);
     if (fd < 0)
         return -1;
     ssize_t written = write(fd, request, CTRL_REQUEST_SIZE);
     if (written != CTRL_REQUEST_SIZE) {
+        *error = written < 0 ? errno : EPIPE;
         TarnLog("%s:%d Failed to send command.", kCtrlUnit, 55);
         close(fd);
         return -1;
     }
-    if (!WaitReadable(fd)) {
+    if (!SocketWaitReady(fd, false, static_cast<long long>(timeoutMs) * 1000)) {
+        *error = ETIMEDOUT;
         if (fd > 0)
             close(fd);
         return -1;
@@ -106,6 +126,7 @@ int CtrlSendRequest(const ControlRequest *request, char *reply, int replySize)
     ssize_t n = read(fd, reply, static_cast<size_t>(replySize));
     int result = 0;
     if (n < 1) {
+        *error = n < 0 ? errno : EPIPE;
         TarnLog("%s:%d Failed to read action [%m]", kCtrlUnit, 73);
         result = -1;
     }

@@ -14,6 +14,16 @@ int CtrlConnect();
 // reply (waiting at most 0.5 s) into reply[0..replySize). 0 or -1.
 int CtrlSendRequest(const ControlRequest *request, char *reply, int replySize);
 
+// CtrlConnect and CtrlSendRequest for clients that tell people why a request
+// failed: the wait for the reply is timeoutMs, and *error (when given) gets
+// 0 or the errno of the step that failed: ENOENT or ECONNREFUSED (the
+// daemon is not running), EACCES or EPERM (not allowed to use the socket),
+// ETIMEDOUT (no reply in time), EPIPE (the daemon closed the connection
+// without a reply) or another socket error.
+int CtrlConnectWhy(int *error);
+int CtrlSendRequestTimed(const ControlRequest *request, char *reply, int replySize, int timeoutMs,
+                         int *error);
+
 // Player actions (the reply is read and dropped).
 int CtrlPlayPause();
 int CtrlStop();

@@ -119,7 +119,12 @@ struct PlayerStatusShm {
     char currentUri[4096];       // 4120
     int32_t duration;            // 8216
     int32_t position;            // 8220
-    char unused8224[4104];       // 8224
+    // Why the last song could not be played, written by mplayer-daemon
+    // before it reports the song as ended; failSerial counts the reports
+    // (0 when the process starts), so a reader sees each one once.
+    int32_t failSerial;          // 8224
+    char failReason[1020];       // 8228
+    char unused9248[3080];       // 9248
     char radioStation[512];      // 12328
     char streamTitle[264];       // 12840
 };
@@ -128,6 +133,7 @@ static_assert(offsetof(PlayerStatusShm, state) == 4112, "state");
 static_assert(offsetof(PlayerStatusShm, currentUri) == 4120, "currentUri");
 static_assert(offsetof(PlayerStatusShm, duration) == 8216, "duration");
 static_assert(offsetof(PlayerStatusShm, position) == 8220, "position");
+static_assert(offsetof(PlayerStatusShm, failSerial) == 8224, "failSerial");
 static_assert(offsetof(PlayerStatusShm, radioStation) == 12328, "radioStation");
 static_assert(offsetof(PlayerStatusShm, streamTitle) == 12840, "streamTitle");
 

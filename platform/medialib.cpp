@@ -663,8 +663,10 @@ int MediaLib::Exec(const char *sql)
     return rc == SQLITE_OK ? 0 : -1;
 }
 
-int MediaLib::Open(const std::string &path, bool create)
+int MediaLib::Open(const std::string &path, bool create, bool readOnly)
 {
+    if (readOnly)
+        create = false;
     Close();
     path_ = path;
     error_.clear();
@@ -677,11 +679,24 @@ int MediaLib::Open(const std::string &path, bool create)
         std::error_code ec;
         fs::create_directories(fs::path(path).parent_path(), ec);
     }
-    int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | (create ? SQLITE_OPEN_CREATE : 0);
+    int flags = (readOnly ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE) | SQLITE_OPEN_NOMUTEX |
+                (create ? SQLITE_OPEN_CREATE : 0);
     if (sqlite3_open_v2(path.c_str(), &db_, flags, nullptr) != SQLITE_OK)
         return Fail("cannot open the media library"), Close(), -1;
     sqlite3_busy_timeout(db_, 5000);
     sqlite3_extended_result_codes(db_, 0);
+    if (readOnly) {
+        Stmt v(db_, "PRAGMA application_id");
+        if (!v.ok() || v.Step() != SQLITE_ROW)
+            return Fail("cannot read the media library"), Close(), -1;
+        if (v.ColInt(0) != kApplicationId) {
+            error_ = path_ + " is not a media library (run \"tarnlib scan DIR\" to create one)";
+            TLOG("%s", error_.c_str());
+            Close();
+            return -1;
+        }
+        return 0;
+    }
     if (Exec("PRAGMA journal_mode=WAL") != 0 || Exec("PRAGMA foreign_keys=ON") != 0 ||
         Exec("PRAGMA synchronous=NORMAL") != 0) {
         Fail("cannot open the media library");

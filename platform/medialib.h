@@ -99,8 +99,10 @@ public:
 
     // Opens (create: creating when missing) the database and checks it.
     // Returns 0, or -1 with a message in LastError() (not a database, locked,
-    // unreadable ...). Without create a missing file fails.
-    int Open(const std::string &path, bool create);
+    // unreadable ...). Without create a missing file fails. readOnly opens
+    // an existing library for reading only (clients that search and browse
+    // it; no write access to the file needed).
+    int Open(const std::string &path, bool create, bool readOnly = false);
     void Close();
     const std::string &LastError() const { return error_; }
 

@@ -74,7 +74,10 @@ LocalPlayer::LocalPlayer()
       position(-1),
       mplayerFd(-1),
       lastVolumeCheck(time(nullptr)),
-      volume(50)
+      volume(50),
+      errorCount(0),
+      failSerialSeen(0),
+      muted(false)
 {
     int stored = VolumeConfGet();
     if (stored != -1)
@@ -95,6 +98,8 @@ int LocalPlayer::AttachMplayerFd(int fd)
     if (mplayerFd >= 0 && mplayerFd != fd)
         close(mplayerFd);
     mplayerFd = fd;
+    // A new process counts its failure reports from 0.
+    failSerialSeen = 0;
     return 0;
 }
 
@@ -109,6 +114,18 @@ int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     char text[CTRL_PARAM_SIZE + 1];
     memcpy(text, request->parameter, CTRL_PARAM_SIZE);
     text[CTRL_PARAM_SIZE] = '\0';
+
+    switch (request->action) {
+    case ACT_PLAY_PAUSE:
+    case ACT_PLAY_INDEX:
+    case ACT_NEXT:
+    case ACT_PREVIOUS:
+        // A play request starts afresh: earlier errors are history.
+        lastError.clear();
+        break;
+    default:
+        break;
+    }
 
     switch (request->action) {
     case ACT_PLAY_PAUSE:
@@ -244,7 +261,6 @@ void LocalPlayer::CloseMplayerFd()
 
 int LocalPlayer::StartMplayer(const std::string &uri)
 {
-    lastError.clear();
     if (IsMplayerAlive())
         KillMplayer();
     // Whatever connection is left belongs to a process that is gone; the new
@@ -275,6 +291,7 @@ int LocalPlayer::StartMplayer(const std::string &uri)
     argv.push_back(nullptr);
     if (TLIBCExecv(exe.c_str(), argv.data(), 1) == -1) {
         TLOG("Failed to start MPlayer");
+        SetError("cannot start the player program " + exe);
         return -1;
     }
     return 0;
@@ -282,7 +299,6 @@ int LocalPlayer::StartMplayer(const std::string &uri)
 
 int LocalPlayer::LoadFile(const std::string &uri)
 {
-    lastError.clear();
     std::string cmd = LoadFileCommand(uri);
     if (SendCommand(cmd.data(), cmd.size()) != 0) {
         TLOG("Failed to send action [%s]", cmd.c_str());
@@ -357,8 +373,10 @@ int LocalPlayer::Step(bool forward, bool automatic)
         }
         // Skip a song the player cannot play, until the queue comes back
         // round to where it started.
-        if (playlist->Current() == start)
+        if (playlist->Current() == start) {
+            SetError("no song of the queue can be played");
             break;
+        }
     }
     Stop();
     return -1;
@@ -486,6 +504,14 @@ int LocalPlayer::Poll(PlayerStatusShm *segment)
     position = shm->position;
     streamTitle = FieldText(segment->streamTitle, sizeof(segment->streamTitle));
     radioStation = FieldText(segment->radioStation, sizeof(segment->radioStation));
+    muted = shm->value4108 != 0;
+    int32_t serial = shm->failSerial;
+    if (serial != failSerialSeen) {
+        failSerialSeen = serial;
+        std::string why = FieldText(segment->failReason, sizeof(segment->failReason));
+        if (!why.empty())
+            SetError(why);
+    }
 
     int32_t reported = shm->state;
     if (reported == 0)
@@ -556,6 +582,8 @@ int LocalPlayer::GetStatusJson(Json::Value &reply)
     reply["RadioStation"] = radioStation;
     reply["Volume"] = volume;
     reply["last_error"] = lastError;
+    reply["error_count"] = errorCount;
+    reply["Muted"] = mplayerFd >= 0 && muted;
     return 0;
 }
 
@@ -572,11 +600,18 @@ void LocalPlayer::OnMplayerClosed()
         return;
     CloseMplayerFd();
     TLOG("mplayer-daemon ended while playing [%s]", currentUri.c_str());
-    lastError = "the player program ended unexpectedly";
+    SetError("the player program ended unexpectedly");
+    muted = false;
     state = PLAYER_STATE_STOPPED;
     // It is our child when we started it: collect its exit status.
     while (waitpid(-1, nullptr, WNOHANG) > 0) {
     }
+}
+
+void LocalPlayer::SetError(const std::string &why)
+{
+    lastError = why;
+    ++errorCount;
 }
 
 void LocalPlayer::SaveVolumeAndKill()

@@ -43,8 +43,10 @@ public:
     int GetMplayerFd() const { return mplayerFd; }
     int GetPosition() const { return position; }
     const std::string &GetCurrentUri() const { return currentUri; }
-    // Why playback last stopped on its own ("" when it did not).
+    // Why playback last stopped or skipped a song on its own ("" when it did
+    // not since the last play request); the count of such errors since start.
     const std::string &GetLastError() const { return lastError; }
+    int GetErrorCount() const { return errorCount; }
 
     // How soon the loop must poll again, in ms: often while a song plays
     // (its end is acted on within a poll), seldom while paused, never (-1)
@@ -81,6 +83,10 @@ private:
     time_t lastVolumeCheck;
     int32_t volume;
     std::string lastError;
+    int32_t errorCount;
+    int32_t failSerialSeen;  // mplayer-daemon's failure reports already taken
+    bool muted;              // as mplayer-daemon last reported it
+    void SetError(const std::string &why);
 };
 
 #endif

@@ -86,25 +86,25 @@ q() { $CTL "$@" > /dev/null 2>>"$OUT/tarnctl.err" || echo "leakcheck:   (tarnctl
 step "queue and local playback"
 q queue add "$ROOT/share/Music/tone-440.mp3" "$ROOT/share/Music/tone-660.flac" "$ROOT/share/Music/tone-880.ogg"
 q queue insert 1 "$ROOT/share/Music/tone-660.flac"
-q play 0
+q play 1
 sleep 2
 q status
 q volume 30
-q volume up
+q volume +3
 q seek 1
-q mute
-q mute
+q mute toggle
+q mute toggle
 q eq 1 2 3 0 0 0 0 0 -2 -4
 q next
 sleep 1
 q pause
 q play
 q repeat all
-q shuffle
-q repeat cycle
+q shuffle toggle
+q repeat off
 q queue list
 q queue remove 1
-q queue current 0
+q queue current 1
 q prev
 sleep 4
 q stop
@@ -120,14 +120,14 @@ if [ -x /usr/bin/gmediarender ]; then
     sleep 1
     i=0
     until $CTL --json renderers 2>/dev/null | grep -q '"total" : [1-9]'; do
-        [ $((i % 10)) = 0 ] && q search renderers
+        [ $((i % 10)) = 0 ] && q discover renderers
         i=$((i + 1))
         [ $i -gt 60 ] && { echo "leakcheck:   renderer not found; going on without it"; break; }
         sleep 0.5
     done
     q servers
-    q select 0
-    q play 0
+    q select 1
+    q play 1
     sleep 3
     q status
     q volume 20
@@ -136,7 +136,7 @@ if [ -x /usr/bin/gmediarender ]; then
     q next
     sleep 2
     q stop
-    q select 0
+    q select 1
     q select local
     kill "$RENDERER" 2>/dev/null
     wait "$RENDERER" 2>/dev/null
@@ -155,9 +155,9 @@ q source next
 q source prev
 q source radio
 sleep 1
-q save 1
+q slot save 1
 q source playlist
-q save 2
+q slot save 2
 q source custom 1
 q source custom 2
 q source custom 9

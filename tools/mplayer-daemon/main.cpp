@@ -254,6 +254,7 @@ int main(int argc, char **argv)
     StatusSegment segment;
     segment.Attach(TarnShmKeyPlayer());
     segment.SetPid(static_cast<int>(getpid()));
+    segment.ClearFailures();
 
     PlaybinPlayer player(&segment);
     app.player = &player;

@@ -2,7 +2,9 @@
 
 #include "platform/tarn_log.h"
 
+#include <cerrno>
 #include <cstring>
+#include <unistd.h>
 
 static const char kLogUnit[] = "mplayer-daemon";
 
@@ -233,6 +235,7 @@ int PlaybinPlayer::Load(const std::string &uriText)
 
     if (uri.empty()) {
         TLOG("Cannot play [%s]: not a URI or file path.", uriText.c_str());
+        ReportFailure("not a URI or file path");
         mode_ = ENDED;
         failId_ = g_timeout_add(kFailedSongDelayMs, &PlaybinPlayer::OnFailedSongEnd, this);
         return -1;
@@ -248,6 +251,7 @@ int PlaybinPlayer::Load(const std::string &uriText)
             gst_message_unref(msg);
         } else {
             TLOG("Failed to start playing [%s].", uriText.c_str());
+            ReportFailure("the player could not start it");
             mode_ = ENDED;
             gst_element_set_state(playbin_, GST_STATE_NULL);
             failId_ = g_timeout_add(kFailedSongDelayMs, &PlaybinPlayer::OnFailedSongEnd, this);
@@ -443,6 +447,7 @@ void PlaybinPlayer::HandleError(GstMessage *msg)
     gst_message_parse_error(msg, &err, &debug);
     if (mode_ == PLAYING || mode_ == PAUSED) {
         TLOG("Failed to play [%s]: %s", uriText_.c_str(), err ? err->message : "unknown error");
+        ReportFailure(err ? err->message : "unknown error");
         mode_ = ENDED;
         StopTimers();
         gst_element_set_state(playbin_, GST_STATE_NULL);
@@ -450,6 +455,22 @@ void PlaybinPlayer::HandleError(GstMessage *msg)
     }
     g_clear_error(&err);
     g_free(debug);
+}
+
+void PlaybinPlayer::ReportFailure(const char *what)
+{
+    std::string why = what ? what : "unknown error";
+    if (!isStream_) {
+        std::string path = uriText_;
+        if (g_str_has_prefix(uriText_.c_str(), "file:")) {
+            gchar *local = g_filename_from_uri(uriText_.c_str(), nullptr, nullptr);
+            path = local ? local : "";
+            g_free(local);
+        }
+        if (!path.empty() && access(path.c_str(), R_OK) != 0)
+            why = strerror(errno);
+    }
+    segment_->ReportFailure("cannot play " + uriText_ + ": " + why);
 }
 
 void PlaybinPlayer::HandleTags(GstTagList *tags)

@@ -52,6 +52,9 @@ private:
     void HandleTags(GstTagList *tags);
     void HandleEos();
     void HandleError(GstMessage *msg);
+    // Reports why the current song cannot be played (a local file's own
+    // problem when it has one, else what GStreamer said).
+    void ReportFailure(const char *what);
     void UpdateProgress();
     void StartTick();
     void StopTimers();

@@ -124,3 +124,22 @@ void StatusSegment::SetPid(int pid)
     if (shm_)
         shm_->value4116 = pid;
 }
+
+void StatusSegment::ReportFailure(const std::string &reason)
+{
+    if (!shm_)
+        return;
+    CopyTextField(shm_->failReason, sizeof(shm_->failReason), reason);
+    // The text first: a reader that sees the new serial finds it complete.
+    __atomic_thread_fence(__ATOMIC_SEQ_CST);
+    volatile int32_t *serial = &shm_->failSerial;
+    *serial = *serial + 1;
+}
+
+void StatusSegment::ClearFailures()
+{
+    if (!shm_)
+        return;
+    shm_->failSerial = 0;
+    CopyTextField(shm_->failReason, sizeof(shm_->failReason), std::string());
+}

@@ -36,6 +36,10 @@ public:
     // the daemon does not read (4104, 4108, 4116) for diagnostics.
     void SetVolumeInfo(int volume, bool muted);
     void SetPid(int pid);
+    // A song that cannot be played: the reason, then the serial counted up.
+    // ClearFailures (at start) empties both.
+    void ReportFailure(const std::string &reason);
+    void ClearFailures();
 
 private:
     PlayerStatusShm *shm_;
