@@ -44,6 +44,8 @@ public:
     SongServer(const SongServer &) = delete;
     SongServer &operator=(const SongServer &) = delete;
 
+    // The HTTP server, for more routes before Bind().
+    httplib::Server &Http() { return *server; }
     // Binds the listening socket; returns the port, or -1.
     int Bind();
     // Serves until Stop(); 0 when stopped, -1 on a listening error.
