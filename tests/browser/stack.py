@@ -9,11 +9,18 @@ import os
 import shutil
 import signal
 import socket
+import struct
 import subprocess
 import tempfile
 import time
 import urllib.error
 import urllib.request
+
+ACT_PLAY_INDEX = 8
+ACT_GET_STATUS = 19
+ACT_QUEUE_ADD = 20
+ACT_QUEUE_LIST = 27
+ACT_SELECT_PLAYER = 18
 
 SRC = os.path.abspath(os.path.join(os.path.dirname(__file__), '..', '..'))
 
@@ -109,9 +116,27 @@ class Stack:
             raise RuntimeError('tarnctl %s: %s' % (' '.join(args), r.stdout))
         return r
 
+    def daemon(self, action, text=''):
+        """One request on the daemon's control socket, as its clients send
+        it: the parsed JSON reply."""
+        request = struct.pack('=i', action) + text.encode().ljust(8192, b'\0')
+        with socket.socket(socket.AF_UNIX, socket.SOCK_STREAM) as s:
+            s.settimeout(5)
+            s.connect(os.path.join(self.root, 'tmp/tarnaudiod.sock'))
+            s.sendall(request)
+            reply = b''
+            while len(reply) < 8192:
+                chunk = s.recv(8192)
+                if not chunk:
+                    break
+                reply += chunk
+        return json.loads(reply.split(b'\0', 1)[0].decode())
+
     def daemon_status(self):
-        """The daemon's own status reply (ACT_GET_STATUS) through tarnctl."""
-        return json.loads(self.ctl('--json', 'status').stdout)
+        return self.daemon(ACT_GET_STATUS)
+
+    def daemon_queue(self):
+        return self.daemon(ACT_QUEUE_LIST, '0 64')
 
     def api(self, path, body=None, headers=None):
         """One API request: (HTTP status, parsed JSON or None)."""
@@ -140,6 +165,7 @@ class Stack:
             return ''
 
     def stop(self):
+        self.web_out.close()
         for p in self.procs:
             if p.poll() is None:
                 p.send_signal(signal.SIGTERM)
@@ -150,7 +176,8 @@ class Stack:
                     p.wait()
         pidfile = os.path.join(self.root, 'var/run/tarnaudiod.pid')
         try:
-            pid = int(open(pidfile).read().strip())
+            with open(pidfile) as f:
+                pid = int(f.read().strip())
             os.kill(pid, signal.SIGTERM)
             for _ in range(150):
                 # Reap it when it is our child's child that we inherited.
@@ -158,7 +185,11 @@ class Stack:
                     os.waitpid(pid, os.WNOHANG)
                 except ChildProcessError:
                     pass
-                if not os.path.exists('/proc/%d' % pid) or open('/proc/%d/stat' % pid).read().split()[2] == 'Z':
+                try:
+                    with open('/proc/%d/stat' % pid) as f:
+                        if f.read().split()[2] == 'Z':
+                            break
+                except OSError:
                     break
                 time.sleep(0.1)
         except (OSError, ValueError):
