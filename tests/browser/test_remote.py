@@ -23,7 +23,7 @@ from selenium.webdriver.chrome.service import Service  # noqa: E402
 from selenium.webdriver.common.by import By  # noqa: E402
 from selenium.webdriver.common.keys import Keys  # noqa: E402
 
-BUILD = sys.argv.pop(1) if len(sys.argv) > 1 else os.path.join(stack.SRC, 'build')
+BUILD = os.path.join(stack.SRC, 'build')
 
 
 def media_info(path, title, artist='Tarn Demo Band', album='Tarn Demo Tones', duration=30.0):
@@ -174,4 +174,6 @@ class RemoteInBrowser(unittest.TestCase):
 
 
 if __name__ == '__main__':
+    if len(sys.argv) > 1 and os.path.isdir(sys.argv[1]):
+        BUILD = sys.argv.pop(1)
     unittest.main(verbosity=2)

@@ -537,16 +537,23 @@ function connect() {
     status: renderStatus,
     scan: renderScan,
     open: () => { if (state.status && state.status.daemon) $('alert').hidden = true; },
-    error: (rs) => { if (rs === EventSource.CLOSED) { events = null; act(() => get('/api/session')).then(() => setTimeout(connect, 3000)); } },
+    error: (rs) => { if (rs === EventSource.CLOSED) { events = null; reconnect(); } },
   });
 }
 
 // The shown position moves on between updates while a song plays.
 setInterval(() => { if (state.status && state.status.state === 2) renderProgress(); }, 1000);
 
-(async () => {
+// A stream the server refused: a password to give, or the server is away.
+async function reconnect() {
   const s = await act(() => get('/api/session'));
-  if (s && s.password && !s.ok) await get('/api/status').catch(() => null);
-  connect();
-  showTab('queue');
-})();
+  if (s && s.password && !s.ok) {
+    await get('/api/status').catch(() => null);  // asks for the password, then connects
+    loaders[state.tab]();
+  } else {
+    setTimeout(connect, 3000);
+  }
+}
+
+connect();
+showTab('queue');
