@@ -57,6 +57,7 @@ def main():
                 c.connect(os.path.join(s.root, 'tmp/tarnaudiod.sock'))
                 c.sendall(req)
                 c.recv(8192)
+        s.daemon(25, '3')  # repeat the whole queue: every next has a song to go to
         s.daemon(stack.ACT_PLAY_INDEX, '0')
         wait_for('playing', lambda: s.daemon_status().get('CurrentUri'))
 

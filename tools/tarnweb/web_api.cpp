@@ -28,6 +28,8 @@ const char kEqSystem[] = "/usr/tarn/etc.defaults/audio/equalizer.system";
 const char kEqUser[] = "/usr/tarn/etc/audio/equalizer.user";
 const int kCustomSlots = 6;      // slots offered by the page: 1..6
 const size_t kMostSongsPerAdd = 2000;
+// The station list files are read, changed and written whole: one change at a time.
+std::mutex radioMutex;
 
 std::string Compact(const Json::Value &v)
 {
@@ -843,6 +845,7 @@ void WebRemote::RegisterApi(httplib::Server &server)
         Ok(res);
     });
     server.Post("/api/radio/add", [](Req req, Res res) {
+        std::lock_guard<std::mutex> lock(radioMutex);
         Json::Value body;
         if (!Body(req, res, &body))
             return;
@@ -861,6 +864,7 @@ void WebRemote::RegisterApi(httplib::Server &server)
         Ok(res);
     });
     server.Post("/api/radio/rename", [](Req req, Res res) {
+        std::lock_guard<std::mutex> lock(radioMutex);
         Json::Value body, list;
         int index = 0;
         if (!Body(req, res, &body))
@@ -886,6 +890,7 @@ void WebRemote::RegisterApi(httplib::Server &server)
         Ok(res);
     });
     server.Post("/api/radio/remove", [](Req req, Res res) {
+        std::lock_guard<std::mutex> lock(radioMutex);
         Json::Value body, list;
         int index = 0;
         if (!Body(req, res, &body))
