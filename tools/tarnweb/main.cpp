@@ -1,12 +1,15 @@
-// tarnweb: serves the songs that the daemon hands to UPnP renderers.
+// tarnweb: the appliance's web server. It serves the songs that the daemon
+// hands to UPnP renderers and the web remote (the page people play music
+// from, its JSON API and live status).
 //
 //   tarnweb [--port N] [--bind ADDR] [--threads N] [--max-per-client N] [--db FILE]
 //           [--write-timeout SEC] [--access-log FILE]
-//           [--verbose]
+//           [--www DIR] [--no-remote] [--verbose]
 //
 // The port defaults to "admin_port" of /etc/tarninfo.conf, the port the
-// daemon writes into its song URLs. "--port 0" takes any free port. Once
-// listening it prints "tarnweb: listening on ADDR:PORT" on standard output.
+// daemon writes into its song URLs; the address to "web_bind" there, else
+// 0.0.0.0. "--port 0" takes any free port. Once listening it prints
+// "tarnweb: listening on ADDR:PORT" and, with the remote, the page's URL.
 // SIGTERM or SIGINT stop it.
 #include <signal.h>
 #include <unistd.h>
@@ -15,14 +18,17 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <string>
 #include <thread>
 
 #include "daemon/tarn_types.h"
+#include "platform/medialib.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"
 #include "tools/tarnweb/song_server.h"
+#include "tools/tarnweb/web_remote.h"
 
 namespace {
 
@@ -30,14 +36,19 @@ void Usage(FILE *out)
 {
     fprintf(out,
             "usage: tarnweb [--port N] [--bind ADDR] [--threads N] [--db FILE]\n"
-            "               [--write-timeout SEC] [--access-log FILE] [--verbose]\n"
+            "               [--max-per-client N] [--write-timeout SEC] [--access-log FILE]\n"
+            "               [--www DIR] [--no-remote] [--verbose]\n"
             "  --port N          port to listen on (default: admin_port of %s; 0: any)\n"
-            "  --bind ADDR       address to listen on (default 0.0.0.0)\n"
+            "  --bind ADDR       address to listen on (default: web_bind of the\n"
+            "                    configuration, or 0.0.0.0)\n"
             "  --threads N       requests served at once (default 32)\n"
             "  --max-per-client N connections of one client address at once (default 8)\n"
             "  --db FILE         media library database (default %s)\n"
             "  --write-timeout S drop a client that takes nothing for S seconds (default 60)\n"
             "  --access-log FILE append one line per song request to FILE\n"
+            "  --www DIR         the web remote's files (default: web_root of the\n"
+            "                    configuration, or ../share/tarnweb/www beside the program)\n"
+            "  --no-remote       serve songs only, no web remote\n"
             "  --verbose         one line per request on standard error\n",
             TarnPath(TARN_INFO_CONF).c_str(), "/usr/tarn/var/medialib.db");
 }
@@ -58,7 +69,8 @@ int main(int argc, char **argv)
 {
     TarnLogOpen("tarnweb");
     SongServerOptions options;
-    bool portGiven = false;
+    WebRemoteOptions remoteOptions;
+    bool portGiven = false, bindGiven = false, remoteOn = true;
     for (int i = 1; i < argc; ++i) {
         std::string a = argv[i];
         const char *value = i + 1 < argc ? argv[i + 1] : nullptr;
@@ -69,6 +81,9 @@ int main(int argc, char **argv)
         } else if (a == "--verbose") {
             options.verbose = true;
             continue;
+        } else if (a == "--no-remote") {
+            remoteOn = false;
+            continue;
         } else if (!value) {
             fprintf(stderr, "tarnweb: %s needs a value (see --help)\n", a.c_str());
             return 2;
@@ -77,6 +92,9 @@ int main(int argc, char **argv)
             portGiven = ok;
         } else if (a == "--bind") {
             options.bindAddress = value;
+            bindGiven = true;
+        } else if (a == "--www") {
+            remoteOptions.wwwDir = value;
         } else if (a == "--threads") {
             ok = ParseInt(value, 1, 256, &options.threads);
         } else if (a == "--max-per-client") {
@@ -97,8 +115,13 @@ int main(int argc, char **argv)
         }
         ++i;
     }
+    std::string conf = TarnPath(TARN_INFO_CONF);
+    if (!bindGiven) {
+        char bind[64] = "";
+        if (TLIBCFileGetKeyValue(conf.c_str(), "web_bind", bind, sizeof(bind), 0) > 0)
+            options.bindAddress = bind;
+    }
     if (!portGiven) {
-        std::string conf = TarnPath(TARN_INFO_CONF);
         char port[16] = "";
         if (TLIBCFileGetKeyValue(conf.c_str(), "admin_port", port, sizeof(port), 0) <= 0 ||
             !ParseInt(port, 1, 65535, &options.port)) {
@@ -115,7 +138,25 @@ int main(int argc, char **argv)
     pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
     signal(SIGPIPE, SIG_IGN);
 
+    std::unique_ptr<WebRemote> remote;
+    if (remoteOn) {
+        // Live status streams hold a worker each: they get threads of their own.
+        options.threads += remoteOptions.maxStreams;
+        if (!options.dbPath.empty())
+            MediaLibSetDefaultPath(options.dbPath);  // the playlist functions read it too
+        remoteOptions.dbPath = options.dbPath;
+        remote.reset(new WebRemote(remoteOptions));
+        std::string why;
+        if (remote->Init(&why) != 0) {
+            fprintf(stderr, "tarnweb: no web remote: %s (songs are served; --no-remote hides this)\n",
+                    why.c_str());
+            TarnLog("%s:%d No web remote: %s", "tarnweb", __LINE__, why.c_str());
+            remote.reset();
+        }
+    }
     SongServer server(options);
+    if (remote)
+        remote->Register(server.Http());
     int port = server.Bind();
     if (port <= 0) {
         fprintf(stderr, "tarnweb: cannot listen on %s:%d (in use, or not an address of this machine)\n",
@@ -125,12 +166,23 @@ int main(int argc, char **argv)
         return 1;
     }
     printf("tarnweb: listening on %s:%d\n", options.bindAddress.c_str(), port);
+    if (remote) {
+        std::string host = options.bindAddress == "0.0.0.0" || options.bindAddress == "::"
+                               ? "127.0.0.1" : options.bindAddress;
+        if (host.find(':') != std::string::npos)
+            host = "[" + host + "]";
+        printf("tarnweb: web remote at http://%s:%d/\n", host.c_str(), port);
+    }
     fflush(stdout);
 
     std::atomic<bool> served(false);
-    std::thread waiter([&server, &served, stopSignals] {
+    WebRemote *remoteP = remote.get();
+    std::thread waiter([&server, &served, stopSignals, remoteP] {
         int sig = 0;
         sigwait(&stopSignals, &sig);
+        // Live status streams end first, so the workers can finish.
+        if (remoteP)
+            remoteP->Stop();
         // Repeated: a signal that comes before the server loop has started
         // would otherwise be lost.
         while (!served.load()) {

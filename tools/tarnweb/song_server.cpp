@@ -198,10 +198,6 @@ SongServer::SongServer(const SongServerOptions &opts)
                 [serve](const httplib::Request &req, httplib::Response &res) { serve(req, res, true); });
     server->Get(R"(/audio/webUI/audiotransfer\.cgi/([^/]+))",
                 [serve](const httplib::Request &req, httplib::Response &res) { serve(req, res, false); });
-    server->Get(R"(.*)", [](const httplib::Request &req, httplib::Response &res) {
-        TLOG("No such resource [%.200s] from %s", req.path.c_str(), req.remote_addr.c_str());
-        NotFound(req, res);
-    });
     if (options.verbose) {
         server->set_logger([](const httplib::Request &req, const httplib::Response &res) {
             fprintf(stderr, "tarnweb: %s %s %s -> %d\n", req.remote_addr.c_str(), req.method.c_str(),
@@ -306,6 +302,11 @@ void SongServer::ServeFile(const httplib::Request &req, httplib::Response &res,
 
 int SongServer::Bind()
 {
+    // Last: routes added by others (the web remote) come before it.
+    server->Get(R"(.*)", [](const httplib::Request &req, httplib::Response &res) {
+        TLOG("No such resource [%.200s] from %s", req.path.c_str(), req.remote_addr.c_str());
+        NotFound(req, res);
+    });
     int port = options.port;
     if (port == 0)
         port = server->bind_to_any_port(options.bindAddress);

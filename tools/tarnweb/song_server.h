@@ -19,11 +19,8 @@
 #include <mutex>
 #include <string>
 
-class GuardedServer;
-namespace httplib {
-struct Request;
-struct Response;
-}
+#include "tools/tarnweb/guarded_server.h"
+
 class MediaLib;
 
 struct SongServerOptions {
@@ -44,6 +41,8 @@ public:
     SongServer(const SongServer &) = delete;
     SongServer &operator=(const SongServer &) = delete;
 
+    // The HTTP server, for more routes before Bind().
+    httplib::Server &Http() { return *server; }
     // Binds the listening socket; returns the port, or -1.
     int Bind();
     // Serves until Stop(); 0 when stopped, -1 on a listening error.
