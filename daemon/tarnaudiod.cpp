@@ -75,6 +75,15 @@ UpnpPlayer *FindPlayerByIndex(std::vector<UpnpPlayer *> &players, int index)
     return nullptr;
 }
 
+UpnpPlayer *FindPlayerByUdn(std::vector<UpnpPlayer *> &players, const std::string &udn)
+{
+    for (UpnpPlayer *p : players) {
+        if (p->GetUdn() == udn)
+            return p;
+    }
+    return nullptr;
+}
+
 void SelectPlayer(const char *parameter, UpnpController *controller,
                   std::vector<UpnpPlayer *> &upnpPlayers)
 {
@@ -92,8 +101,15 @@ void SelectPlayer(const char *parameter, UpnpController *controller,
     // read the renderer's record under the controller's lock.
     controller->Lock();
     int rc = controller->SelectRenderer(static_cast<unsigned>(index));
-    if (rc == 0 && !FindPlayerByIndex(upnpPlayers, index))
-        upnpPlayers.push_back(new UpnpPlayer(controller, index));
+    RENDERER_INFO *r = nullptr;
+    if (rc == 0 && controller->GetRenderer(static_cast<unsigned>(index), &r) == 0) {
+        // A renderer that was here before finds its player and queue again.
+        UpnpPlayer *player = FindPlayerByUdn(upnpPlayers, r->udn);
+        if (!player)
+            upnpPlayers.push_back(new UpnpPlayer(controller, index));
+        else if (player->IsGone())
+            player->OnRendererBack(index);
+    }
     controller->Unlock();
     if (rc != 0)
         return;  // out of range; the controller logs
@@ -190,6 +206,7 @@ void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPla
         controller->SearchServers();
         return;
     case ACT_SEARCH_RENDERERS:
+        controller->SearchQuick();
         controller->SearchRenderers();
         return;
     case ACT_LIST_SERVERS:
@@ -268,8 +285,17 @@ int HandleRequest(int fd, LocalPlayer *localPlayer, UpnpController *controller,
 // ---------------------------------------------------------------------------
 // Process start-up, loop and shutdown.
 
-// The self-pipe that wakes the loop's wait when SIGTERM arrives.
+// The self-pipe that wakes the loop's wait when SIGTERM arrives or the
+// control point has news for the renderer players.
 static int g_wakePipe[2] = {-1, -1};
+
+static void DaemonWake()
+{
+    if (g_wakePipe[1] >= 0) {
+        ssize_t w = write(g_wakePipe[1], "u", 1);
+        (void)w;  // a full pipe already wakes the loop
+    }
+}
 
 void DaemonOnSigterm(int)
 {
@@ -361,6 +387,7 @@ int DaemonStart(DaemonContext &ctx)
         TarnLog("%s:%d Failed to init Upnp Controller", kLogUnit, 471);
         return -1;
     }
+    ctx.controller->SetWakeup(DaemonWake);
     ctx.localPlayer = new LocalPlayer();
     ctx.playerShm = static_cast<PlayerStatusShm *>(
         ShmCreateAttach(TarnShmKeyPlayer(), TARN_SHM_PLAYER_SIZE, 1));
@@ -374,6 +401,9 @@ int DaemonStart(DaemonContext &ctx)
         TarnLog("%s:%d Failed to create shared memory. (%m)", kLogUnit, 490);
         return -1;
     }
+    // Devices already on the network answer the short searches within a
+    // second; the long ones are the searches of old.
+    ctx.controller->SearchQuick();
     ctx.controller->SearchServers();
     ctx.controller->SearchRenderers();
     return 0;
@@ -482,17 +512,35 @@ void DaemonLoopTurn(DaemonContext &ctx)
     UpnpController *controller = ctx.controller;
     std::vector<UpnpPlayer *> &players = ctx.upnpPlayers;
     controller->Lock();
+    time_t now = time(nullptr);
     for (size_t i = 0; i < players.size();) {
         UpnpPlayer *player = players[i];
         int index = controller->FindRendererByUdn(player->GetUdn());
         if (index == -1) {
-            if (player->GetRendererIndex() == g_selectedRenderer)
-                g_selectedRenderer = -1;
-            delete player;
-            players.erase(players.begin() + static_cast<long>(i));
-            if (!g_localSelected)
-                g_changed = 1;
+            // The renderer left: its player and queue are kept for a while,
+            // should it come back (a restart, a short loss of the network).
+            if (!player->IsGone()) {
+                bool selected = !g_localSelected && player->GetRendererIndex() == g_selectedRenderer;
+                if (player->GetRendererIndex() == g_selectedRenderer)
+                    g_selectedRenderer = -1;
+                player->OnRendererGone(selected);
+                if (!g_localSelected)
+                    g_changed = 1;
+            } else if (now - player->GoneSince() >= DAEMON_RENDERER_KEEP_SECONDS) {
+                delete player;
+                players.erase(players.begin() + static_cast<long>(i));
+                continue;
+            }
+            ++i;
             continue;
+        }
+        if (player->IsGone()) {
+            player->OnRendererBack(index);
+            // It was playing for the user, and nothing else was chosen since.
+            if (player->WasSelected() && !g_localSelected && g_selectedRenderer == -1) {
+                g_selectedRenderer = index;
+                g_changed = 1;
+            }
         }
         if (index != player->GetRendererIndex()) {
             if (player->GetRendererIndex() == g_selectedRenderer)
@@ -519,6 +567,11 @@ void DaemonLoopTurn(DaemonContext &ctx)
             selected->PublishStatus(ctx.publishedShm);
         else
             memset(ctx.publishedShm, 0, TARN_SHM_PUBLISHED_SIZE);
+    } else {
+        // The selected renderer left: nothing plays (the changed flag stays).
+        int32_t changed = ctx.publishedShm->changed;
+        memset(ctx.publishedShm, 0, TARN_SHM_PUBLISHED_SIZE);
+        ctx.publishedShm->changed = changed;
     }
 }
 

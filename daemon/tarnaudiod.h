@@ -30,6 +30,10 @@ struct DaemonContext {
 // deadlines decide what each poll sends).
 #define DAEMON_RENDERER_POLL_MS 100
 
+// How long a renderer's player and queue are kept after it left the
+// network; selected again within that time, it finds its queue.
+#define DAEMON_RENDERER_KEEP_SECONDS (15 * 60)
+
 // SIGTERM: clears the running flag and wakes the loop's wait.
 void DaemonOnSigterm(int sig);
 

@@ -409,6 +409,26 @@ int Playlist::Next(std::string &uri, bool automatic)
     return GetCurrentUri(uri);
 }
 
+int Playlist::PeekNext(unsigned *entry) const
+{
+    size_t n = order.size();
+    if (n == 0 || mode < 1 || mode > 3 || entry == nullptr)
+        return -1;
+    size_t k = orderIndex >= n ? 0 : orderIndex;
+    if (mode == 1) {
+        if (k + 1 >= n)
+            return -1;
+        ++k;
+    } else if (mode == 3) {
+        k = (k + 1) % n;
+    }
+    int32_t e = order[k];
+    if (e < 0 || static_cast<size_t>(e) >= entries.size() || !entries[static_cast<size_t>(e)])
+        return -1;
+    *entry = static_cast<unsigned>(e);
+    return 0;
+}
+
 int Playlist::Previous(std::string &uri, bool automatic)
 {
     size_t n = order.size();

@@ -54,6 +54,9 @@ public:
     int GetCurrentInfoJson(Json::Value &info);
     int Next(std::string &uri, bool automatic);
     int Previous(std::string &uri, bool automatic);
+    // The entry that Next(uri, true) would move to, without moving: 0 and
+    // *entry, or -1 at the end of the queue ("Normal") or when it is empty.
+    int PeekNext(unsigned *entry) const;
     int ListJson(int start, int limit, Json::Value &reply);
     int HandleAction(const ControlRequest *request, Json::Value &reply);
 

@@ -1,7 +1,6 @@
 #include "player/upnpplayer.h"
 
 #include <strings.h>
-#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
@@ -24,8 +23,19 @@ static const char kLogUnit[] = "upnpplayer";
 namespace {
 
 const int kUrlSize = 4096;
-const int kWaitStepMs = 200;
-const int kStopWaitSteps = 6;
+// A job without an ending after this long is given up.
+const int kJobGiveUpSeconds = 40;
+// The next song is handed to the renderer this long before the end.
+const int kHandNextBeforeEndSeconds = 2;
+
+// What the player's job does.
+enum {
+    JOB_NONE = 0,
+    JOB_PLAY,    // [Stop,] SetAVTransportURI, Play: the current song
+    JOB_REPLAY,  // Play: "Repeat One" at the end of the song
+    JOB_NEXT,    // SetNextAVTransportURI: the next song, handed ahead
+    JOB_STOP,    // Stop, in order after what is in flight
+};
 
 const char *StateText(int s)
 {
@@ -56,7 +66,14 @@ UpnpPlayer::UpnpPlayer(UpnpController *controller, int rendererIndex)
       lastSendGetInfo(time(nullptr)),
       lastCheckState(lastSendGetInfo),
       playStarted(0),
-      replayPending(0)
+      jobId(0),
+      jobKind(JOB_NONE),
+      jobStarted(0),
+      nextDirty(false),
+      nextRefused(false),
+      playingReportsAtStart(0),
+      goneSince(0),
+      wasSelected(false)
 {
     if (!controller || rendererIndex < 0 ||
         controller->GetRenderer(static_cast<unsigned>(rendererIndex), &renderer) != 0 || !renderer) {
@@ -158,31 +175,47 @@ int UpnpPlayer::BuildSongUrl(const TARN_MEDIA_INFO *info, std::string &url)
     return 0;
 }
 
-// Lets the libupnp threads deliver answers while this thread waits, then
-// finds the renderer again: it may have left or moved meanwhile.
-RENDERER_INFO *UpnpPlayer::WaitUnlocked(int milliseconds)
+int UpnpPlayer::SongUrlAndMetadata(const TARN_MEDIA_INFO *song, std::string &url,
+                                   std::string &metadata)
 {
-    controller->Unlock();
-    usleep(milliseconds * 1000);
-    controller->Lock();
-    renderer = nullptr;
-    int index = controller->FindRendererByUdn(udn);
-    if (index < 0)
-        return nullptr;
-    controller->SelectRenderer(static_cast<unsigned>(index));
-    RENDERER_INFO *r = nullptr;
-    if (controller->GetRenderer(static_cast<unsigned>(index), &r) != 0)
-        return nullptr;
-    renderer = r;
-    return r;
+    if (BuildSongUrl(song, url) != 0) {
+        TLOG("Failed to convert uri for audiotransfer.cgi");
+        return -1;
+    }
+    if (BuildDidlMetadata(song, url.c_str(), metadata) != 0) {
+        TLOG("Failed to combine metadata.");
+        return -1;
+    }
+    return 0;
 }
 
+// Starts a job on this player's renderer (the controller's current one).
+int UpnpPlayer::StartJob(int kind, const std::vector<RendererAction> &steps, const std::string &url)
+{
+    long id = controller->StartJob(steps);
+    if (id <= 0) {
+        jobId = 0;
+        jobKind = JOB_NONE;
+        return -1;
+    }
+    jobId = id;
+    jobKind = kind;
+    jobUrl = url;
+    jobStarted = time(nullptr);
+    return 0;
+}
+
+// The current song is handed over and played. The steps run one after the
+// other as the renderer answers them (on the controller's threads); this
+// returns at once, and the poll takes the outcome: PLAYING once the
+// renderer accepted Play, a logged failure otherwise.
 int UpnpPlayer::PlayCurrent()
 {
     TARN_MEDIA_INFO *song = new TARN_MEDIA_INFO;
     int result = -1;
     RENDERER_INFO *r = nullptr;
     std::string url, metadata;
+    std::vector<RendererAction> steps;
     if (playlist->GetCurrentSong(song) != 0) {
         TLOG("Failed to get current song in playlist.");
         goto out;
@@ -192,51 +225,129 @@ int UpnpPlayer::PlayCurrent()
         goto out;
     }
     renderer = r;
-    if (r->transport_state != "STOPPED") {
-        if (controller->Stop() != 0) {
-            TLOG("Failed to send upnp stop");
-            goto out;
-        }
-        playStarted = 0;
-        // Wait for the renderer to report that it stopped; each step asks it
-        // again and leaves the lock to the threads that bring the answer.
-        for (int i = 0; i < kStopWaitSteps; ++i) {
-            if (r->transport_state == "STOPPED" || r->transport_state == "NO_MEDIA_PRESENT")
-                break;
-            controller->GetTransportInfo();
-            r = WaitUnlocked(kWaitStepMs);
-            if (!r) {
-                TLOG("Renderer [%s] left while stopping", udn.c_str());
-                goto out;
-            }
-        }
-    }
-    if (BuildSongUrl(song, url) != 0) {
-        TLOG("Failed to convert uri for audiotransfer.cgi");
+    if (SongUrlAndMetadata(song, url, metadata) != 0)
         goto out;
-    }
-    if (BuildDidlMetadata(song, url.c_str(), metadata) != 0) {
-        TLOG("Failed to combine metadata.");
-        goto out;
-    }
-    if (controller->SetAVTransportURI(url.c_str(), metadata.c_str()) != 0) {
+    // A renderer that plays is stopped first; the next action goes out when
+    // it has answered, so nothing waits here.
+    if (!r->transport_state.empty() && r->transport_state != "STOPPED" &&
+        r->transport_state != "NO_MEDIA_PRESENT")
+        steps.push_back(UpnpController::MakeAction("Stop", {"InstanceID"}, {"0"}));
+    steps.push_back(UpnpController::MakeAction("SetAVTransportURI",
+                                               {"InstanceID", "CurrentURI", "CurrentURIMetaData"},
+                                               {"0", url, metadata}));
+    steps.push_back(UpnpController::MakeAction("Play", {"InstanceID", "Speed"}, {"0", "1"}));
+    playStarted = 0;
+    nextUrl.clear();
+    nextDirty = false;
+    nextRefused = false;
+    playingReportsAtStart = r->playing_reports;
+    if (StartJob(JOB_PLAY, steps, url) != 0) {
         TLOG("Failed to set current uri [%s]", url.c_str());
+        lastError = "The renderer did not take the song";
+        SetState(PLAYER_STATE_STOPPED);
         goto out;
     }
-    if (!WaitUnlocked(kWaitStepMs)) {
-        TLOG("Renderer [%s] left before play", udn.c_str());
-        goto out;
-    }
-    if (controller->Play() != 0) {
-        TLOG("Failed to send upnp play");
-        goto out;
-    }
-    SetState(PLAYER_STATE_PLAYING);
-    playStarted = 1;
+    // Not PLAYING until the renderer says so.
+    SetState(PLAYER_STATE_TRANSITIONING);
+    lastError.clear();
     result = 0;
 out:
     delete song;
     return result;
+}
+
+// The poll found the player's job ended.
+void UpnpPlayer::FinishJob(RENDERER_INFO *r)
+{
+    int kind = jobKind;
+    std::string url = jobUrl;
+    bool ok = r->job_error == 0;
+    jobId = 0;
+    jobKind = JOB_NONE;
+    switch (kind) {
+    case JOB_PLAY:
+    case JOB_REPLAY:
+        if (ok) {
+            playingUrl = url.empty() ? playingUrl : url;
+            SetState(PLAYER_STATE_PLAYING);
+            playStarted = 1;
+            // Without events, only answers asked from now on tell that it
+            // played.
+            if (!r->transport_events)
+                playingReportsAtStart = r->playing_reports;
+            break;
+        }
+        if (kind == JOB_REPLAY) {
+            // The renderer forgot the song at its end (some clear their
+            // URI): it is handed over again at once.
+            PlayCurrent();
+            break;
+        }
+        if (r->job_failed == "SetAVTransportURI")
+            TLOG("Failed to set current uri [%s]", url.c_str());
+        else if (r->job_failed == "Stop")
+            TLOG("Failed to send upnp stop");
+        else
+            TLOG("Failed to send upnp play");
+        lastError = "The renderer refused " + r->job_failed + " (" + std::to_string(r->job_error) + ")";
+        playStarted = 0;
+        SetState(PLAYER_STATE_STOPPED);
+        break;
+    case JOB_NEXT:
+        if (ok) {
+            nextUrl = url;
+        } else {
+            TLOG("Failed to set next uri [%s]", url.c_str());
+            nextRefused = true;
+        }
+        break;
+    default:
+        break;
+    }
+}
+
+// Hands the song that follows to the renderer, so that it moves on by
+// itself without a gap. An empty URI withdraws one handed before.
+int UpnpPlayer::HandNext(RENDERER_INFO *r)
+{
+    nextDirty = false;
+    unsigned entry = 0;
+    std::string url, metadata;
+    if (playlist->GetMode() != 2 && playlist->PeekNext(&entry) == 0) {
+        const QueueEntry *e = playlist->Entry(entry);
+        TARN_MEDIA_INFO *song = new TARN_MEDIA_INFO;
+        e->ToMediaInfo(song);
+        int rc = SongUrlAndMetadata(song, url, metadata);
+        delete song;
+        if (rc != 0) {
+            nextRefused = true;
+            return -1;
+        }
+    }
+    if (url == nextUrl)
+        return 0;
+    std::vector<RendererAction> steps;
+    steps.push_back(UpnpController::MakeAction("SetNextAVTransportURI",
+                                               {"InstanceID", "NextURI", "NextURIMetaData"},
+                                               {"0", url, metadata}));
+    nextUrl.clear();
+    if (StartJob(JOB_NEXT, steps, url) != 0) {
+        nextRefused = true;
+        return -1;
+    }
+    return 0;
+}
+
+// The renderer went on to the song handed ahead: the queue follows.
+void UpnpPlayer::FollowNext(RENDERER_INFO *r)
+{
+    std::string uri;
+    playlist->Next(uri, true);
+    playingUrl = nextUrl;
+    nextUrl.clear();
+    playingReportsAtStart = r->playing_reports;
+    SetState(PLAYER_STATE_PLAYING);
+    playStarted = 1;
 }
 
 int UpnpPlayer::PlayPause()
@@ -253,8 +364,8 @@ int UpnpPlayer::PlayPause()
             return -1;
         }
         SetState(PLAYER_STATE_PLAYING);
-    } else if (PlayCurrent() != 0) {
-        return -1;
+    } else {
+        return PlayCurrent();
     }
     playStarted = 1;
     return 0;
@@ -262,27 +373,31 @@ int UpnpPlayer::PlayPause()
 
 int UpnpPlayer::Stop()
 {
-    int r = controller->Stop();
+    // After whatever is in flight, so that a Play on its way cannot follow.
+    controller->CancelJob();
+    std::vector<RendererAction> steps;
+    steps.push_back(UpnpController::MakeAction("Stop", {"InstanceID"}, {"0"}));
+    int r = StartJob(JOB_STOP, steps, std::string());
     SetState(PLAYER_STATE_STOPPED);
     playStarted = 0;
+    nextUrl.clear();
     return r;
 }
 
 int UpnpPlayer::Next(bool automatic)
 {
     if (automatic && playlist->GetMode() == 2) {
-        if (!replayPending) {
-            // The renderer still holds the song: play it again.
-            if (controller->Play() != 0)
-                TLOG("Failed to send upnp play");
-            else
-                replayPending = 1;
-            return -1;
+        // The renderer still holds the song: play it again. When it refuses,
+        // the song is handed over again (FinishJob).
+        std::vector<RendererAction> steps;
+        steps.push_back(UpnpController::MakeAction("Play", {"InstanceID", "Speed"}, {"0", "1"}));
+        playStarted = 0;
+        if (renderer)
+            playingReportsAtStart = renderer->playing_reports;
+        if (StartJob(JOB_REPLAY, steps, playingUrl) != 0) {
+            TLOG("Failed to send upnp play");
+            PlayCurrent();
         }
-        // Still stopped one check after that Play: this renderer forgot the
-        // song at its end (some clear their URI), so it is given again.
-        replayPending = 0;
-        PlayCurrent();
         return -1;
     }
     std::string uri;
@@ -352,6 +467,7 @@ int UpnpPlayer::GetStatusJson(Json::Value &reply)
     reply["last_send_get_info"] = static_cast<Json::Int64>(lastSendGetInfo);
     reply["last_check_state"] = static_cast<Json::Int64>(lastCheckState);
     reply["RelTime"] = EstimateRelTime(reply.get("RelTime", 0).asInt());
+    reply["last_error"] = lastError;
     return 0;
 }
 
@@ -369,8 +485,6 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     const char *text = request->parameter;
     int result = 0;
     controller->Lock();
-    if (code >= ACT_PLAY_PAUSE && code <= ACT_SEEK)
-        replayPending = 0;
     // The record may have been replaced since the last turn.
     RENDERER_INFO *r = nullptr;
     int index = controller->FindRendererByUdn(udn);
@@ -429,6 +543,9 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     case ACT_TOGGLE_SHUFFLE:
     case ACT_QUEUE_LIST:
         playlist->HandleAction(request, reply);
+        // The song handed ahead may no longer be the one that follows.
+        if (code != ACT_QUEUE_LIST)
+            nextDirty = true;
         break;
     default:
         TarnLog("%s:%d Action [%d] not handled", kLogUnit, 739, code);
@@ -437,6 +554,31 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     }
     controller->Unlock();
     return result;
+}
+
+void UpnpPlayer::OnRendererGone(bool selected)
+{
+    goneSince = time(nullptr);
+    wasSelected = selected;
+    renderer = nullptr;
+    rendererIndex = -1;
+    state = PLAYER_STATE_NONE;
+    playStarted = 0;
+    jobId = 0;
+    jobKind = JOB_NONE;
+    nextUrl.clear();
+    lastError = "The renderer left the network";
+}
+
+void UpnpPlayer::OnRendererBack(int index)
+{
+    goneSince = 0;
+    rendererIndex = index;
+    RENDERER_INFO *r = nullptr;
+    if (controller->GetRenderer(static_cast<unsigned>(index), &r) == 0)
+        renderer = r;
+    lastSendGetInfo = lastCheckState = time(nullptr);
+    lastError.clear();
 }
 
 int UpnpPlayer::Poll()
@@ -451,12 +593,28 @@ int UpnpPlayer::Poll()
         return -1;
     renderer = r;
 
+    if (jobKind != JOB_NONE && r->job_done == static_cast<uint32_t>(jobId)) {
+        FinishJob(r);
+    } else if (jobKind != JOB_NONE && time(nullptr) - jobStarted > kJobGiveUpSeconds) {
+        // No answer came (libupnp answers every request, if only with a
+        // time-out; this is the player's own bound).
+        TLOG("Renderer [%s] did not answer [%s]", udn.c_str(), r->job_sent.c_str());
+        if (jobKind == JOB_PLAY || jobKind == JOB_REPLAY) {
+            lastError = "The renderer did not answer";
+            playStarted = 0;
+            SetState(PLAYER_STATE_STOPPED);
+        }
+        jobId = 0;
+        jobKind = JOB_NONE;
+    }
+
     int s = StateFromText(r->transport_state);
     if (s == PLAYER_STATE_NONE)
         return 0;
-    state = s;
-    if (s != PLAYER_STATE_STOPPED)
-        replayPending = 0;
+    // While the song is being handed over the renderer's own state (the
+    // stop before it, say) is not the player's.
+    if (jobKind != JOB_PLAY && jobKind != JOB_REPLAY)
+        state = s;
     mute = strtol(r->mute.c_str(), nullptr, 10) != 0;
     volume = static_cast<int32_t>(strtol(r->volume.c_str(), nullptr, 10));
 
@@ -466,9 +624,29 @@ int UpnpPlayer::Poll()
         controller->GetPositionInfo();
         controller->GetTransportInfo();
     }
+    if (playStarted == 1 && jobKind == JOB_NONE) {
+        bool played = r->playing_reports != playingReportsAtStart;
+        if (!nextUrl.empty() && r->current_uri == nextUrl && nextUrl != playingUrl) {
+            // The renderer moved on to the song handed ahead.
+            FollowNext(r);
+        } else if (state == PLAYER_STATE_STOPPED && played) {
+            // It played and stopped: the song ended (the renderer said so
+            // in an event or an answer). The queue moves on at once.
+            lastCheckState = now;
+            Next(true);
+        } else if (r->can_set_next && played && state == PLAYER_STATE_PLAYING && !nextRefused &&
+                   (nextDirty || nextUrl.empty()) && r->duration > 0 &&
+                   EstimateRelTime(r->rel_time) >= r->duration - kHandNextBeforeEndSeconds) {
+            // Handed in the song's last seconds: some renderers announce the
+            // next song as soon as they have it buffered, long before they
+            // play it; this late, they switch when the song ends.
+            HandNext(r);
+        }
+    }
+    // For renderers that tell nothing: every 6 seconds at most.
     if (now - lastCheckState >= 6) {
         lastCheckState = now;
-        if (playStarted == 1 && state == PLAYER_STATE_STOPPED)
+        if (playStarted == 1 && jobKind == JOB_NONE && state == PLAYER_STATE_STOPPED)
             Next(true);
     }
     return 0;
@@ -485,13 +663,13 @@ int UpnpPlayer::PublishStatus(PublishedStatusShm *segment)
     controller->Lock();
     RENDERER_INFO *r = nullptr;
     int index = controller->FindRendererByUdn(udn);
-    if (index < 0 || controller->GetRenderer(static_cast<unsigned>(index), &r) != 0 || !r) {
-        controller->Unlock();
-        return -1;
-    }
-    renderer = r;
-    int32_t rendererVolume = static_cast<int32_t>(strtol(r->volume.c_str(), nullptr, 10));
-    if (state != PLAYER_STATE_PLAYING && state != PLAYER_STATE_PAUSED) {
+    if (index < 0 || controller->GetRenderer(static_cast<unsigned>(index), &r) != 0 || !r)
+        r = nullptr;
+    else
+        renderer = r;
+    int32_t rendererVolume = r ? static_cast<int32_t>(strtol(r->volume.c_str(), nullptr, 10)) : 0;
+    // A renderer that left plays nothing for us: state 0, texts cleared.
+    if (!r || (state != PLAYER_STATE_PLAYING && state != PLAYER_STATE_PAUSED)) {
         int32_t changed = segment->changed;
         memset(segment, 0, sizeof(*segment));
         segment->changed = changed;

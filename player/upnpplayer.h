@@ -4,6 +4,7 @@
 
 #include <ctime>
 #include <string>
+#include <vector>
 
 #include <json/json.h>
 
@@ -12,6 +13,7 @@
 class Playlist;
 class UpnpController;
 struct RENDERER_INFO;
+struct RendererAction;
 
 class UpnpPlayer {
 public:
@@ -33,6 +35,13 @@ public:
     int GetRendererIndex() const { return rendererIndex; }
     void SetRendererIndex(int index) { rendererIndex = index; }
     const std::string &GetUdn() const { return udn; }
+    // The renderer left the network: the player stays (with its queue) but
+    // does nothing until OnRendererBack. selected: it was the selected one.
+    void OnRendererGone(bool selected);
+    void OnRendererBack(int index);
+    bool IsGone() const { return goneSince != 0; }
+    time_t GoneSince() const { return goneSince; }
+    bool WasSelected() const { return wasSelected; }
     Playlist *GetPlaylist() { return playlist; }
     int GetState() const { return state; }
 
@@ -44,7 +53,11 @@ private:
     int PlayIndex(const char *text);
     int Seek(const char *text);
     int GetStatusJson(Json::Value &reply);
-    RENDERER_INFO *WaitUnlocked(int milliseconds);
+    int StartJob(int kind, const std::vector<RendererAction> &steps, const std::string &url);
+    void FinishJob(RENDERER_INFO *r);
+    int HandNext(RENDERER_INFO *r);
+    void FollowNext(RENDERER_INFO *r);
+    int SongUrlAndMetadata(const TARN_MEDIA_INFO *song, std::string &url, std::string &metadata);
 
     int32_t state;
     Playlist *playlist;
@@ -58,9 +71,23 @@ private:
     time_t lastCheckState;
     int32_t playStarted;
     std::string host;
-    // 1 after "Repeat One" sent Play at a song's end, until the renderer
-    // reports anything but STOPPED.
-    int32_t replayPending;
+
+    // The job this player waits for (UpnpController::StartJob) and what it
+    // does; 0 / JOB_NONE when none.
+    long jobId;
+    int jobKind;
+    time_t jobStarted;
+    std::string jobUrl;      // the song URL the job hands over
+    std::string playingUrl;  // the URL of the song the renderer plays
+    std::string nextUrl;     // the URL handed as the next song
+    bool nextDirty;          // the queue changed after nextUrl was handed
+    bool nextRefused;        // the renderer refused a next song for this one
+    // The renderer's count of PLAYING reports when this song was started:
+    // a later one means it really played, so a STOPPED is the song's end.
+    uint32_t playingReportsAtStart;
+    time_t goneSince;  // when the renderer left; 0 while it is there
+    bool wasSelected;
+    std::string lastError;
 };
 
 #endif

@@ -10,7 +10,7 @@ gstreamer1.0-plugins-base gstreamer1.0-plugins-good gstreamer1.0-plugins-ugly
 gstreamer1.0-libav gstreamer1.0-alsa
 libtag1-dev libsqlite3-dev sqlite3 libcurl4-openssl-dev libcpp-httplib-dev libssl-dev
 lame flac vorbis-tools sox iproute2 procps util-linux python3 curl
-gmediarender minidlna mpd
+gmediarender rygel rygel-playbin minidlna mpd
 chromium chromium-driver python3-selenium"
 if [ "$(id -u)" != "0" ]; then
     echo "setup.sh must run as root to install packages. Run:"

@@ -46,16 +46,21 @@ bool SupportsRelTimeSeek(IXML_Document *scpd)
     return XmlHasChildWithText(mode, "allowedValue", "REL_TIME");
 }
 
-bool SupportsSetVolume(IXML_Document *scpd)
+bool SupportsAction(IXML_Document *scpd, const char *action)
 {
-    if (scpd == nullptr) {
+    if (scpd == nullptr || action == nullptr) {
         TLOG("Bad parameter");
         return false;
     }
     IXML_Element *actions = XmlGetDocElement(scpd, "actionList");
     if (actions == nullptr)
         return false;
-    return XmlFindItemByChildText(actions, "action", "name", "SetVolume") != nullptr;
+    return XmlFindItemByChildText(actions, "action", "name", action) != nullptr;
+}
+
+bool SupportsSetVolume(IXML_Document *scpd)
+{
+    return SupportsAction(scpd, "SetVolume");
 }
 
 int GetRendererCapability(IXML_Document *description, RENDERER_INFO *renderer)
@@ -63,6 +68,7 @@ int GetRendererCapability(IXML_Document *description, RENDERER_INFO *renderer)
     if (renderer != nullptr) {
         renderer->can_seek = false;
         renderer->can_set_volume = false;
+        renderer->can_set_next = false;
     }
     if (description == nullptr || renderer == nullptr) {
         TLOG("Bad parameter");
@@ -91,6 +97,7 @@ int GetRendererCapability(IXML_Document *description, RENDERER_INFO *renderer)
         return -1;
     }
     renderer->can_seek = SupportsRelTimeSeek(avtDoc);
+    renderer->can_set_next = SupportsAction(avtDoc, "SetNextAVTransportURI");
     renderer->can_set_volume = SupportsSetVolume(rcsDoc);
     ixmlDocument_free(rcsDoc);
     ixmlDocument_free(avtDoc);

@@ -20,6 +20,9 @@ bool IsLimitedModel(IXML_Document *description, RENDERER_INFO *renderer);
 // values of A_ARG_TYPE_SeekMode.
 bool SupportsRelTimeSeek(IXML_Document *scpd);
 
+// A service description lists that action.
+bool SupportsAction(IXML_Document *scpd, const char *action);
+
 // RenderingControl description: a "SetVolume" action.
 bool SupportsSetVolume(IXML_Document *scpd);
 

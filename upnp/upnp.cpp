@@ -31,6 +31,10 @@ static const char kRcsType[] = "urn:schemas-upnp-org:service:RenderingControl:1"
 static const char kCmsType[] = "urn:schemas-upnp-org:service:ConnectionManager:1";
 
 static const int kSearchMx = 1800;
+static const int kQuickSearchMx = 1;
+// Polling requests are not sent while this many AVTransport requests to the
+// renderer are unanswered (a renderer that stopped answering).
+static const int kMaxOutstanding = 4;
 static const int kSubscribeTimeout = 1800;
 static const int kMaxContentLength = 32000;
 static const uint32_t kNoRenderer = static_cast<uint32_t>(-1);
@@ -143,11 +147,39 @@ void UpnpController::Unlock()
 // ---------------------------------------------------------------------------
 // Searches and list maintenance.
 
+bool UpnpController::IsServiceType(const char *type, const char *service)
+{
+    static const char kPrefix[] = "urn:schemas-upnp-org:service:";
+    size_t prefix = sizeof(kPrefix) - 1, length = strlen(service);
+    if (type == nullptr || strncmp(type, kPrefix, prefix) != 0 ||
+        strncmp(type + prefix, service, length) != 0 || type[prefix + length] != ':')
+        return false;
+    const char *version = type + prefix + length + 1;
+    if (*version < '1' || *version > '9')
+        return false;
+    for (const char *p = version; *p; ++p)
+        if (*p < '0' || *p > '9')
+            return false;
+    return true;
+}
+
 int UpnpController::Search(const char *target)
+{
+    return Search(target, kSearchMx);
+}
+
+int UpnpController::SearchQuick()
+{
+    int a = Search(kCdsType, kQuickSearchMx);
+    int b = Search(kAvtType, kQuickSearchMx);
+    return a == 0 && b == 0 ? 0 : -1;
+}
+
+int UpnpController::Search(const char *target, int mx)
 {
     if (target == nullptr)
         return -1;
-    int rc = UpnpSearchAsync(client_handle, kSearchMx, target, this);
+    int rc = UpnpSearchAsync(client_handle, mx, target, this);
     if (rc != UPNP_E_SUCCESS) {
         TLOG("Failed to search [%s], [%s]", target, UpnpGetErrorMessage(rc));
         return -1;
@@ -399,6 +431,17 @@ int UpnpController::OnUpnpEvent(Upnp_EventType type, const void *event, void *co
     case UPNP_EVENT_UNSUBSCRIBE_COMPLETE:
         self->OnSubscription(static_cast<const UpnpEventSubscribe *>(event));
         return -1;
+    case UPNP_EVENT_AUTORENEWAL_FAILED:
+    case UPNP_EVENT_SUBSCRIPTION_EXPIRED: {
+        // No more events from that renderer: its answers count again.
+        const char *publisher =
+            UpnpEventSubscribe_get_PublisherUrl_cstr(static_cast<const UpnpEventSubscribe *>(event));
+        ScopedLock lock(self);
+        for (RENDERER_INFO *r : self->renderers)
+            if (r != nullptr && publisher != nullptr && r->avt_event_url == publisher)
+                r->transport_events = false;
+        return -1;
+    }
     default:
         return -1;
     }
@@ -412,8 +455,10 @@ int UpnpController::OnDiscovery(const UpnpDiscovery *event)
     const char *location = UpnpDiscovery_get_Location_cstr(event);
     if (serviceType == nullptr || location == nullptr)
         return -1;
-    bool renderer = strcmp(serviceType, kAvtType) == 0;
-    bool server = !renderer && strcmp(serviceType, kCdsType) == 0;
+    // Devices that announce later versions of the services are taken too:
+    // those versions keep the version-1 actions.
+    bool renderer = IsServiceType(serviceType, "AVTransport");
+    bool server = !renderer && IsServiceType(serviceType, "ContentDirectory");
     if (!renderer && !server)
         return 0;
     // Downloaded outside the lock: a slow device holds only this thread.
@@ -457,7 +502,7 @@ void UpnpController::AddServer(IXML_Document *doc, const char *location)
     unsigned long count = ixmlNodeList_length(services);
     for (unsigned long i = 0; i < count; ++i) {
         IXML_Element *service = reinterpret_cast<IXML_Element *>(ixmlNodeList_item(services, i));
-        if (XmlGetElementChildText(service, "serviceType") == kCdsType)
+        if (IsServiceType(XmlGetElementChildText(service, "serviceType").c_str(), "ContentDirectory"))
             server->cds_control_url =
                 ResolveUrl(server->base_url, XmlGetElementChildText(service, "controlURL"));
     }
@@ -508,22 +553,29 @@ void UpnpController::AddRenderer(IXML_Document *doc, const char *location)
     for (unsigned long i = 0; i < count; ++i) {
         IXML_Element *service = reinterpret_cast<IXML_Element *>(ixmlNodeList_item(services, i));
         std::string type = XmlGetElementChildText(service, "serviceType");
-        std::string *control, *event, *scpd;
-        if (type == kCmsType) {
+        std::string *control, *event, *scpd, *kind;
+        if (IsServiceType(type.c_str(), "ConnectionManager")) {
             control = &renderer->cms_control_url;
             event = &renderer->cms_event_url;
             scpd = &renderer->cms_scpd_url;
-        } else if (type == kRcsType) {
+            kind = &renderer->cms_type;
+        } else if (IsServiceType(type.c_str(), "RenderingControl")) {
             control = &renderer->rcs_control_url;
             event = &renderer->rcs_event_url;
             scpd = &renderer->rcs_scpd_url;
-        } else if (type == kAvtType) {
+            kind = &renderer->rcs_type;
+        } else if (IsServiceType(type.c_str(), "AVTransport")) {
             control = &renderer->avt_control_url;
             event = &renderer->avt_event_url;
             scpd = &renderer->avt_scpd_url;
+            kind = &renderer->avt_type;
         } else {
             continue;
         }
+        // The first service of a kind counts (a device lists each once).
+        if (!kind->empty())
+            continue;
+        *kind = type;
         *control = ResolveUrl(renderer->base_url, XmlGetElementChildText(service, "controlURL"));
         *event = ResolveUrl(renderer->base_url, XmlGetElementChildText(service, "eventSubURL"));
         *scpd = ResolveUrl(renderer->base_url, XmlGetElementChildText(service, "SCPDURL"));
@@ -549,6 +601,7 @@ void UpnpController::AddRenderer(IXML_Document *doc, const char *location)
         }
         renderers.push_back(renderer);
     }
+    Wake();
     int rc = UpnpSubscribeAsync(client_handle, avtEventUrl.c_str(), kSubscribeTimeout,
                                 OnUpnpEvent, this);
     if (rc != UPNP_E_SUCCESS)
@@ -573,16 +626,21 @@ int UpnpController::OnByeBye(const UpnpDiscovery *event)
     const char *deviceId = UpnpDiscovery_get_DeviceID_cstr(event);
     if (serviceType == nullptr || deviceId == nullptr)
         return 0;
-    ScopedLock lock(this);
-    if (strcmp(serviceType, kAvtType) == 0) {
-        int index = FindRendererByUdn(deviceId);
-        if (index >= 0)
-            RemoveRenderer(static_cast<unsigned>(index));
-    } else if (strcmp(serviceType, kCdsType) == 0) {
-        int index = FindServerByUdn(deviceId);
-        if (index >= 0)
-            RemoveServer(static_cast<unsigned>(index));
+    bool removed = false;
+    {
+        ScopedLock lock(this);
+        if (IsServiceType(serviceType, "AVTransport")) {
+            int index = FindRendererByUdn(deviceId);
+            if (index >= 0)
+                removed = RemoveRenderer(static_cast<unsigned>(index)) == 0;
+        } else if (IsServiceType(serviceType, "ContentDirectory")) {
+            int index = FindServerByUdn(deviceId);
+            if (index >= 0)
+                RemoveServer(static_cast<unsigned>(index));
+        }
     }
+    if (removed)
+        Wake();
     return 0;
 }
 
@@ -636,17 +694,33 @@ int UpnpController::SendAction(const char *actionName, const char *serviceType,
         TLOG("Invalid index[%d]", static_cast<int>(current.load()));
         return -1;
     }
+    return SendActionTo(renderer, actionName, serviceType, argNames, argValues, count);
+}
+
+int UpnpController::SendActionTo(RENDERER_INFO *renderer, const char *actionName,
+                                 const char *serviceType, const char **argNames,
+                                 const char **argValues, int count)
+{
     const std::string *controlUrl;
+    const std::string *ownType;
+    bool avt = false;
     if (strcmp(serviceType, kAvtType) == 0) {
         controlUrl = &renderer->avt_control_url;
+        ownType = &renderer->avt_type;
+        avt = true;
     } else if (strcmp(serviceType, kCmsType) == 0) {
         controlUrl = &renderer->cms_control_url;
+        ownType = &renderer->cms_type;
     } else if (strcmp(serviceType, kRcsType) == 0) {
         controlUrl = &renderer->rcs_control_url;
+        ownType = &renderer->rcs_type;
     } else {
         TLOG("Unsupport service type [%s]", serviceType);
         return -1;
     }
+    // The version-1 action, addressed to the service as the device names it.
+    if (!ownType->empty())
+        serviceType = ownType->c_str();
     IXML_Document *action = nullptr;
     for (int i = 0; i < count; ++i) {
         int rc = UpnpAddToAction(&action, actionName, serviceType, argNames[i], argValues[i]);
@@ -663,7 +737,78 @@ int UpnpController::SendAction(const char *actionName, const char *serviceType,
                                  OnUpnpEvent, this);
     if (action != nullptr)
         ixmlDocument_free(action);
-    return rc == UPNP_E_SUCCESS ? 0 : -1;
+    if (rc != UPNP_E_SUCCESS)
+        return -1;
+    if (avt)
+        ++renderer->outstanding;
+    return 0;
+}
+
+RendererAction UpnpController::MakeAction(const char *name, std::vector<std::string> names,
+                                          std::vector<std::string> values)
+{
+    RendererAction a;
+    a.name = name;
+    a.argNames = std::move(names);
+    a.argValues = std::move(values);
+    return a;
+}
+
+void UpnpController::SendJobStep(RENDERER_INFO *renderer)
+{
+    while (!renderer->job_steps.empty()) {
+        RendererAction step = renderer->job_steps.front();
+        renderer->job_steps.erase(renderer->job_steps.begin());
+        std::vector<const char *> names, values;
+        for (size_t i = 0; i < step.argNames.size() && i < step.argValues.size(); ++i) {
+            names.push_back(step.argNames[i].c_str());
+            values.push_back(step.argValues[i].c_str());
+        }
+        if (SendActionTo(renderer, step.name.c_str(), kAvtType, names.data(), values.data(),
+                         static_cast<int>(names.size())) == 0) {
+            renderer->job_sent = step.name;
+            renderer->job_sent_for = renderer->job_id;
+            return;
+        }
+        TLOG("Failed to send action [%s]", step.name.c_str());
+        renderer->job_steps.clear();
+        renderer->job_failed = step.name;
+        renderer->job_error = UPNP_E_INTERNAL_ERROR;
+        renderer->job_done = renderer->job_id;
+    }
+}
+
+long UpnpController::StartJob(const std::vector<RendererAction> &steps)
+{
+    RENDERER_INFO *renderer = nullptr;
+    if (steps.empty() || GetRenderer(current, &renderer) != 0) {
+        TLOG("Invalid index[%d]", static_cast<int>(current.load()));
+        return -1;
+    }
+    if (++lastJobId == 0)
+        lastJobId = 1;
+    renderer->job_id = lastJobId;
+    renderer->job_steps = steps;
+    renderer->job_failed.clear();
+    // One action at a time: a new job waits for the answer to the action
+    // still in flight, so that the renderer takes them in order.
+    if (renderer->job_sent.empty())
+        SendJobStep(renderer);
+    if (renderer->job_done == renderer->job_id && renderer->job_error != 0)
+        return -1;
+    return static_cast<long>(renderer->job_id);
+}
+
+void UpnpController::CancelJob()
+{
+    RENDERER_INFO *renderer = nullptr;
+    if (GetRenderer(current, &renderer) != 0)
+        return;
+    renderer->job_steps.clear();
+    if (renderer->job_sent.empty()) {
+        renderer->job_done = renderer->job_id;
+        renderer->job_error = 0;
+    }
 }
 
 // Sends one action and logs when libupnp refuses it.
@@ -688,8 +833,17 @@ int UpnpController::SetAVTransportURI(const char *uri, const char *metadata)
     TARN_SEND("SetAVTransportURI", kAvtType, names, values);
 }
 
+// A renderer that leaves requests unanswered is not asked more.
+#define TARN_SKIP_WHEN_BUSY()                                                              \
+    do {                                                                                  \
+        RENDERER_INFO *busy = nullptr;                                                    \
+        if (GetRenderer(current, &busy) == 0 && busy->outstanding >= kMaxOutstanding)     \
+            return 0;                                                                     \
+    } while (0)
+
 int UpnpController::GetPositionInfo()
 {
+    TARN_SKIP_WHEN_BUSY();
     const char *names[] = {"InstanceID"};
     const char *values[] = {"0"};
     TARN_SEND("GetPositionInfo", kAvtType, names, values);
@@ -697,6 +851,7 @@ int UpnpController::GetPositionInfo()
 
 int UpnpController::GetTransportInfo()
 {
+    TARN_SKIP_WHEN_BUSY();
     const char *names[] = {"InstanceID"};
     const char *values[] = {"0"};
     TARN_SEND("GetTransportInfo", kAvtType, names, values);
@@ -741,6 +896,17 @@ int UpnpController::SetMute(int mute)
     TARN_SEND("SetMute", kRcsType, names, values);
 }
 
+int UpnpController::SetNextAVTransportURI(const char *uri, const char *metadata)
+{
+    if (uri == nullptr) {
+        TLOG("Bad parameter.");
+        return -1;
+    }
+    const char *names[] = {"InstanceID", "NextURI", "NextURIMetaData"};
+    const char *values[] = {"0", uri, metadata != nullptr ? metadata : ""};
+    TARN_SEND("SetNextAVTransportURI", kAvtType, names, values);
+}
+
 int UpnpController::Seek(int seconds)
 {
     char target[32];
@@ -754,6 +920,29 @@ int UpnpController::Seek(int seconds)
 }
 
 #undef TARN_SEND
+#undef TARN_SKIP_WHEN_BUSY
+
+namespace {
+
+// The action a request document asks for: its first element's name without
+// the namespace prefix ("u:Play" -> "Play").
+std::string ActionNameOf(IXML_Document *request)
+{
+    if (request == nullptr)
+        return std::string();
+    IXML_Node *node = ixmlNode_getFirstChild(reinterpret_cast<IXML_Node *>(request));
+    while (node != nullptr && ixmlNode_getNodeType(node) != eELEMENT_NODE)
+        node = ixmlNode_getNextSibling(node);
+    if (node == nullptr)
+        return std::string();
+    const char *name = ixmlNode_getNodeName(node);
+    if (name == nullptr)
+        return std::string();
+    const char *colon = strchr(name, ':');
+    return colon != nullptr ? colon + 1 : name;
+}
+
+}  // namespace
 
 int UpnpController::OnActionComplete(const UpnpActionComplete *event)
 {
@@ -789,6 +978,8 @@ int UpnpController::OnActionComplete(const UpnpActionComplete *event)
         return -1;
     }
     int code = UpnpActionComplete_get_ErrCode(event);
+    if (renderer->outstanding > 0)
+        --renderer->outstanding;
     if (code == UPNP_E_SOCKET_CONNECT) {
         // The renderer no longer takes connections: it is gone. Nothing of
         // its record may be used after this.
@@ -796,10 +987,35 @@ int UpnpController::OnActionComplete(const UpnpActionComplete *event)
         if (found >= 0)
             RemoveRenderer(static_cast<unsigned>(found));
         TLOG("Action Response not success, [%s]", UpnpGetErrorMessage(code));
+        Wake();
         return -1;
     }
     if (code != UPNP_E_SUCCESS)
         TLOG("Action Response not success, [%s]", UpnpGetErrorMessage(code));
+    // The answer to the job's action in flight: the next one goes out now.
+    if (!renderer->job_sent.empty() &&
+        renderer->job_sent == ActionNameOf(UpnpActionComplete_get_ActionRequest(event))) {
+        std::string name = renderer->job_sent;
+        bool ours = renderer->job_sent_for == renderer->job_id;
+        renderer->job_sent.clear();
+        if (!ours) {
+            // The last action of a job that another one replaced: whatever
+            // its answer, the new job goes on.
+            SendJobStep(renderer);
+        } else if (code != UPNP_E_SUCCESS) {
+            renderer->job_steps.clear();
+            renderer->job_failed = name;
+            renderer->job_error = code;
+            renderer->job_done = renderer->job_id;
+        } else if (renderer->job_steps.empty()) {
+            renderer->job_error = 0;
+            renderer->job_done = renderer->job_id;
+        } else {
+            SendJobStep(renderer);
+        }
+        if (renderer->job_done == renderer->job_id)
+            Wake();
+    }
     IXML_Document *result = UpnpActionComplete_get_ActionResult(event);
     if (result == nullptr) {
         TLOG("action result is NULL");
@@ -847,8 +1063,14 @@ int UpnpController::UpdateTransportInfo(IXML_Element *response, RENDERER_INFO *r
         return -1;
     }
     std::string text = XmlGetElementChildText(response, "CurrentTransportState");
-    if (!text.empty())
+    // A renderer that announces its state in events is followed by those:
+    // an answer may have been on its way while an event overtook it.
+    if (!text.empty() && !renderer->transport_events) {
         renderer->transport_state = text;
+        ++renderer->state_reports;
+        if (text == "PLAYING")
+            ++renderer->playing_reports;
+    }
     return 0;
 }
 
@@ -895,18 +1117,35 @@ int UpnpController::OnEventReceived(const UpnpEvent *event)
     const char *sid = UpnpEvent_get_SID_cstr(event);
     if (sid == nullptr)
         return 0;
-    ScopedLock lock(this);
-    for (RENDERER_INFO *r : renderers) {
-        if (r == nullptr)
-            continue;
-        if (r->avt_sid == sid || r->cms_sid == sid || r->rcs_sid == sid) {
-            if (UpdateFromLastChange(r, event) != 0) {
-                TLOG("Failed to update upnp renderer state");
-                return -1;
+    bool wake = false;
+    {
+        ScopedLock lock(this);
+        for (RENDERER_INFO *r : renderers) {
+            if (r == nullptr)
+                continue;
+            if (r->avt_sid == sid || r->cms_sid == sid || r->rcs_sid == sid) {
+                // libupnp may hand two events of one subscription to two
+                // threads: one older than the last handled is dropped.
+                long *last = r->avt_sid == sid ? &r->avt_event_key
+                             : r->rcs_sid == sid ? &r->rcs_event_key : nullptr;
+                long key = UpnpEvent_get_EventKey(event);
+                if (last != nullptr) {
+                    if (key < *last && *last - key < (1L << 30))
+                        return 0;
+                    *last = key;
+                }
+                std::string state = r->transport_state, uri = r->current_uri, next = r->next_uri;
+                if (UpdateFromLastChange(r, event) != 0) {
+                    TLOG("Failed to update upnp renderer state");
+                    return -1;
+                }
+                wake = state != r->transport_state || uri != r->current_uri || next != r->next_uri;
+                break;
             }
-            return 0;
         }
     }
+    if (wake)
+        Wake();
     return 0;
 }
 
@@ -936,6 +1175,18 @@ int UpnpController::UpdateFromLastChange(RENDERER_INFO *renderer, const UpnpEven
     std::string value = XmlGetDocElementVal(doc, "CurrentTrackURI");
     if (!value.empty())
         renderer->current_uri = value;
+    value = XmlGetDocElementVal(doc, "TransportState");
+    if (!value.empty()) {
+        renderer->transport_state = value;
+        renderer->transport_events = true;
+        ++renderer->state_reports;
+        if (value == "PLAYING")
+            ++renderer->playing_reports;
+    }
+    // The next song as the renderer holds it; an empty val clears it (the
+    // renderer moved on to it, or dropped it).
+    if (XmlGetDocElement(doc, "NextAVTransportURI") != nullptr)
+        renderer->next_uri = value = XmlGetDocElementVal(doc, "NextAVTransportURI");
     value = XmlGetDocElementVal(doc, "CurrentTrackDuration");
     if (!value.empty())
         renderer->duration = TimeStringToSeconds(value.c_str());

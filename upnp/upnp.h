@@ -21,6 +21,12 @@ struct SERVER_INFO {
     std::string cds_control_url;
 };
 
+// One action of a renderer job: sent when the one before it succeeded.
+struct RendererAction {
+    std::string name;
+    std::vector<std::string> argNames, argValues;
+};
+
 struct RENDERER_INFO {
     std::string udn;
     std::string ip;
@@ -40,6 +46,34 @@ struct RENDERER_INFO {
     std::string spare;
     bool can_seek = false;
     bool can_set_volume = false;
+
+    // The service types as the description names them (any version; the
+    // version-1 actions are sent with them).
+    std::string avt_type, rcs_type, cms_type;
+    // The AVTransport offers SetNextAVTransportURI.
+    bool can_set_next = false;
+    // NextAVTransportURI as the renderer last announced it.
+    std::string next_uri;
+    // Transport states that came from the renderer (events or answers), and
+    // of those the PLAYING ones: the player tells them from its own writes.
+    uint32_t state_reports = 0;
+    uint32_t playing_reports = 0;
+    // The renderer announces its transport state in events: answers to
+    // GetTransportInfo, which may be older, then do not overwrite it.
+    bool transport_events = false;
+    // Last event key per subscription: an older event handled late is dropped.
+    long avt_event_key = -1, rcs_event_key = -1;
+    // Requests sent and not answered yet.
+    int outstanding = 0;
+
+    // The running job: actions sent one after the other (see StartJob).
+    std::vector<RendererAction> job_steps;  // not sent yet
+    std::string job_sent;                   // the action waiting for its answer
+    uint32_t job_sent_for = 0;              // the job that action belongs to
+    uint32_t job_id = 0;                    // the job the steps belong to
+    uint32_t job_done = 0;                  // the last job that ended
+    int job_error = 0;                      // its result: 0, or the failure code
+    std::string job_failed;                 // the action that failed
 };
 
 class UpnpController {
@@ -82,6 +116,32 @@ public:
     int Seek(int seconds);
     int SendAction(const char *actionName, const char *serviceType,
                    const char **argNames, const char **argValues, int count);
+    int SetNextAVTransportURI(const char *uri, const char *metadata);
+
+    // Starts a job on the renderer at `current`: its AVTransport actions are
+    // sent in order, each when the one before it was answered with success;
+    // a failure ends the job. A job started while another runs replaces the
+    // other's unsent actions. Returns the job's id (> 0), or -1 when nothing
+    // could be sent. The renderer's job_done and job_error tell the end.
+    long StartJob(const std::vector<RendererAction> &steps);
+    // Drops the unsent actions of the renderer's job (the job then ends with
+    // the answer to the one in flight).
+    void CancelJob();
+    static RendererAction MakeAction(const char *name, std::vector<std::string> names,
+                                     std::vector<std::string> values);
+
+    // Searches with a short MX: devices already on the network answer within
+    // a second. Nothing else differs from SearchServers / SearchRenderers.
+    int SearchQuick();
+
+    // Called (from any thread, without the lock) when something the main
+    // loop acts on arrived: a job ended, a transport state or track changed,
+    // a renderer came or went.
+    void SetWakeup(void (*fn)()) { wakeup = fn; }
+
+    // Whether a service type names that service (e.g. "AVTransport") in any
+    // version from 1 on.
+    static bool IsServiceType(const char *type, const char *service);
 
     static int OnUpnpEvent(Upnp_EventType type, const void *event, void *cookie);
 
@@ -109,6 +169,15 @@ private:
     int OnSubscription(const UpnpEventSubscribe *event);
     int OnEventReceived(const UpnpEvent *event);
     static int UpdateFromLastChange(RENDERER_INFO *renderer, const UpnpEvent *event);
+    int Search(const char *target, int mx);
+    int SendActionTo(RENDERER_INFO *renderer, const char *actionName, const char *serviceType,
+                     const char **argNames, const char **argValues, int count);
+    void SendJobStep(RENDERER_INFO *renderer);
+    void Wake() const
+    {
+        if (wakeup != nullptr)
+            wakeup();
+    }
 
     // Written by the request handler (selection) and by libupnp threads
     // (removal of a renderer), read by the main loop's turn.
@@ -117,6 +186,8 @@ private:
     std::vector<SERVER_INFO *> servers;
     UpnpClient_Handle client_handle;
     pthread_mutex_t mutex;
+    uint32_t lastJobId = 0;
+    void (*wakeup)() = nullptr;
 };
 
 #endif

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include <curl/curl.h>
+#include <sys/utsname.h>
 
 #include "upnp/upnp_sdk.h"
 
@@ -322,6 +323,21 @@ size_t CollectBody(char *ptr, size_t size, size_t count, void *user)
 
 }  // namespace
 
+const char *XmlUserAgent()
+{
+    // The text libupnp puts in its own requests: "<OS>/<release>, UPnP/1.0,
+    // Portable SDK for UPnP devices/<version>". Some devices (GUPnP) describe
+    // their version-1 services only to clients that name this SDK.
+    static const std::string agent = [] {
+        struct utsname names;
+        std::string text = "Linux/unknown";
+        if (uname(&names) == 0)
+            text = std::string(names.sysname) + "/" + names.release;
+        return text + ", UPnP/1.0, Portable SDK for UPnP devices/" UPNP_VERSION_STRING;
+    }();
+    return agent.c_str();
+}
+
 void XmlAbortDownloads(bool abort)
 {
     g_abortDownloads = abort;
@@ -347,6 +363,7 @@ int XmlDownloadDoc(const char *url, IXML_Document **doc)
     curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http");
     curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 0L);
     curl_easy_setopt(curl, CURLOPT_PROXY, "");
+    curl_easy_setopt(curl, CURLOPT_USERAGENT, XmlUserAgent());
     curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, kConnectSeconds);
     curl_easy_setopt(curl, CURLOPT_TIMEOUT, kTotalSeconds);

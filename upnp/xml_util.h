@@ -75,6 +75,9 @@ int XmlParseGuarded(const char *text, IXML_Document **doc);
 // code (UPNP_E_INVALID_DESC for a document that does not parse or is refused).
 int XmlDownloadDoc(const char *url, IXML_Document **doc);
 
+// The User-Agent of description and SCPD downloads: the one libupnp sends.
+const char *XmlUserAgent();
+
 // With true, running and later downloads give up at once (UPNP_E_CANCELED):
 // set while the control point shuts down so that libupnp's threads end
 // promptly. false allows downloads again.

@@ -280,7 +280,7 @@ TEST_F(UpnpEvents, RecordedCraftedAndMalformedLastChange)
     EXPECT_EQ(0, Send("uuid:avt-sid", LastChange("<Event><InstanceID val=\"0\"><CurrentTrackDuration val=\"0:04:05\"/>"
                                                   "<CurrentTrackURI val=\"http://h/b.mp3\"/><TransportState val=\"PLAYING\"/>"
                                                   "<RelativeTimePosition val=\"0:01:00\"/></InstanceID></Event>")));
-    EXPECT_EQ("245 http://h/b.mp3  0", std::to_string(r->duration) + " " + r->current_uri + " " +
+    EXPECT_EQ("245 http://h/b.mp3 PLAYING 0", std::to_string(r->duration) + " " + r->current_uri + " " +
                                            r->transport_state + " " + std::to_string(r->rel_time));
     // Only the first Volume counts, whatever its channel; prefixed elements and
     // unknown subscriptions count not at all.
