@@ -36,6 +36,7 @@
 #include <dirent.h>
 
 #include "daemon/tarn_types.h"
+#include "tests/tools/fakedevice/fake_device.h"
 
 #ifndef TARN_BIN_DIR
 #define TARN_BIN_DIR "build/bin"
@@ -695,6 +696,102 @@ void Idle(Ours &o, Mpd &m)
     AddRow("resident memory idle", "MiB", {ReadProc(o.pid).rssKb / 1024.0}, {ReadProc(m.pid).rssKb / 1024.0});
 }
 
+// A good client's round trips while 3 other clients are connected and say
+// nothing (they stay connected for the whole window).
+void SilentClients(Ours &o, Mpd &m, int repeats)
+{
+    int n = g_quick ? 200 : 1000;
+    std::vector<double> o50, omax, m50, mmax;
+    for (int r = 0; r < repeats; ++r) {
+        Progress("silent clients, run %d/%d (3 silent, %d requests each side)", r + 1, repeats, n);
+        std::vector<int> silent;
+        for (int i = 0; i < 3; ++i) {
+            silent.push_back(ConnectUnix(o.sock));
+            silent.push_back(ConnectUnix(m.sock));
+        }
+        std::vector<double> to, tm;
+        for (int i = 0; i < n; ++i) {
+            auto t0 = Clock::now();
+            if (!o.Text(ACT_GET_STATUS, ""))
+                Die("tarnaudiod stopped answering with silent clients connected");
+            to.push_back(std::chrono::duration<double, std::milli>(Clock::now() - t0).count());
+            t0 = Clock::now();
+            if (!m.Fresh("status"))
+                Die("mpd stopped answering with silent clients connected");
+            tm.push_back(std::chrono::duration<double, std::milli>(Clock::now() - t0).count());
+        }
+        for (int fd : silent) {
+            if (fd >= 0)
+                close(fd);
+        }
+        o50.push_back(Percentile(to, 50));
+        omax.push_back(Percentile(to, 100));
+        m50.push_back(Percentile(tm, 50));
+        mmax.push_back(Percentile(tm, 100));
+    }
+    AddRow("reply while 3 clients are connected and silent, p50", "ms", o50, m50);
+    AddRow("reply while 3 clients are connected and silent, max", "ms", omax, mmax);
+}
+
+// Status requests while ACT_PLAY_INDEX waits on a renderer that stopped
+// answering (gmediarender, SIGSTOPped). Ours only: mpd has no renderers.
+void HungRenderer(Ours &o, const Songs &s)
+{
+    std::string daemonIp = fakedev::ListeningAddress(49152), ip, iface;
+    if (daemonIp.empty() || access("/usr/bin/gmediarender", X_OK) != 0) {
+        Progress("hung renderer: skipped (no UPnP address or no gmediarender)");
+        return;
+    }
+    fakedev::PeerInterface(daemonIp, ip, iface);
+    pid_t renderer = fork();
+    if (renderer == 0) {
+        int null = open("/dev/null", O_RDWR);
+        dup2(null, 1);
+        dup2(null, 2);
+        execl("/usr/bin/gmediarender", "gmediarender", "-I", iface.c_str(), "-p", "49495", "-f",
+              "Compare Renderer", "-u", "5c1e2c3b-4a59-4687-9a0b-c1d2e3f4a5b7", "--gstout-audiopipe",
+              "fakesink sync=true", static_cast<char *>(nullptr));
+        _exit(127);
+    }
+    Progress("hung renderer: waiting for gmediarender to be listed (up to 60 s)");
+    int index = -1;
+    for (int i = 0; i < 200 && index < 0; ++i) {
+        std::string reply;
+        o.Text(ACT_LIST_RENDERERS, "0 0", &reply);
+        size_t at = reply.find("Compare Renderer");
+        size_t idx = at == std::string::npos ? at : reply.find("\"index\"", at);
+        if (idx != std::string::npos)
+            index = atoi(reply.c_str() + reply.find(':', idx) + 1);
+        if (i % 30 == 29)
+            o.Text(ACT_SEARCH_RENDERERS, "");
+        usleep(300 * 1000);
+    }
+    std::vector<double> t;
+    if (index >= 0 && o.Text(ACT_SELECT_PLAYER, std::to_string(index)) && o.AddSong(s.mp3a, 1)) {
+        kill(renderer, SIGSTOP);
+        usleep(100 * 1000);
+        auto t0 = Clock::now();
+        o.Text(ACT_PLAY_INDEX, "0");
+        double reply = std::chrono::duration<double, std::milli>(Clock::now() - t0).count();
+        for (int i = 0; i < 50; ++i) {
+            t0 = Clock::now();
+            if (!o.Text(ACT_GET_STATUS, ""))
+                Die("tarnaudiod stopped answering while a renderer hung");
+            t.push_back(std::chrono::duration<double, std::milli>(Clock::now() - t0).count());
+            usleep(20 * 1000);
+        }
+        AddRow("ACT_PLAY_INDEX reply with the renderer hung", "ms", {reply}, {NAN});
+        AddRow("status request while the renderer hangs, max of 50", "ms", {Percentile(t, 100)}, {NAN});
+        kill(renderer, SIGCONT);
+    } else {
+        Progress("hung renderer: gmediarender was not listed; row left out");
+    }
+    kill(renderer, SIGKILL);
+    waitpid(renderer, nullptr, 0);
+    o.Text(ACT_SELECT_PLAYER, "-1");
+    o.Text(ACT_QUEUE_CLEAR, "");
+}
+
 int LargestOurPage(Ours &o)
 {
     int best = 1;
@@ -933,11 +1030,13 @@ int main(int argc, char **argv)
 
     RoundTrips(ours, mpd, repeats);
     RequestsPerSecond(ours, mpd, repeats);
+    SilentClients(ours, mpd, repeats);
     Idle(ours, mpd);
     QueueRows(ours, mpd, songs, repeats);
     PlayStart(ours, mpd, songs, g_quick ? 3 : 5);
     Gaps(ours, mpd, songs, repeats);
     PlayingCpu(ours, mpd, songs);
+    HungRenderer(ours, songs);
 
     StopOurs(ours);
     StopMpd(mpd);
