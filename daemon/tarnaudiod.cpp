@@ -26,6 +26,9 @@
 
 static const char kLogUnit[] = "tarnaudiod";
 
+// Set by --foreground (DaemonSetForeground).
+static int g_foreground = 0;
+
 namespace {
 
 // How long the handler waits for a request and for the client to take the
@@ -319,7 +322,7 @@ int DaemonInit()
         TarnLog("%s:%d Audio daemon already exists. Pid[%d]", kLogUnit, 67, pid);
         exit(0);
     }
-    if (daemon(0, 0) != 0) {
+    if (!g_foreground && daemon(0, 0) != 0) {
         printf("Failed to daemon()\n");
         fflush(stdout);
         TarnLog("%s:%d Failed to daemon()", kLogUnit, 75);
@@ -333,7 +336,15 @@ int DaemonInit()
         TarnLog("%s:%d Failed to setup signal handler.", kLogUnit, 86);
         return -1;
     }
+    if (g_foreground)
+        signal(SIGINT, DaemonOnSigterm);
     return 0;
+}
+
+void DaemonSetForeground(int on)
+{
+    g_foreground = on;
+    TarnLogToStderr(on != 0);
 }
 
 int DaemonStart(DaemonContext &ctx)

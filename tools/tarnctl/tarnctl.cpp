@@ -22,6 +22,7 @@
 #include "daemon/ctrl.h"
 #include "daemon/tarn_types.h"
 #include "platform/tarn_env.h"
+#include "platform/tarn_version.h"
 
 namespace {
 
@@ -609,8 +610,13 @@ int main(int argc, char **argv)
         else if (opt == "--help") {
             Usage(stdout);
             return 0;
-        } else
-            return Fail("unknown option '%s' (see tarnctl --help)", argv[i]);
+        } else if (opt == "--version") {
+            printf("tarnctl %s\n", TARN_VERSION);
+            return 0;
+        } else {
+            Fail("unknown option '%s' (see tarnctl --help)", argv[i]);
+            return 2;
+        }
     }
     if (i >= argc) {
         Usage(stderr);

@@ -22,10 +22,11 @@
 
 #include "platform/media_playlists.h"
 #include "platform/medialib.h"
+#include "platform/tarn_version.h"
 
-static void Usage()
+static void Usage(FILE *out = stderr)
 {
-    fprintf(stderr,
+    fprintf(out,
             "usage: tarnlib [--db FILE] COMMAND\n"
             "  scan DIR                       add, update and remove the songs and playlists of DIR\n"
             "  songs                          list the songs of the library\n"
@@ -275,9 +276,13 @@ int main(int argc, char **argv)
             MediaLibSetDefaultPath(argv[i + 1]);
             i += 2;
         } else if (strcmp(argv[i], "-h") == 0 || strcmp(argv[i], "--help") == 0) {
-            Usage();
+            Usage(stdout);
+            return 0;
+        } else if (strcmp(argv[i], "-V") == 0 || strcmp(argv[i], "--version") == 0) {
+            printf("tarnlib %s\n", TARN_VERSION);
             return 0;
         } else {
+            fprintf(stderr, "tarnlib: unknown option '%s'\n", argv[i]);
             Usage();
             return 2;
         }

@@ -22,6 +22,7 @@
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"
+#include "platform/tarn_version.h"
 #include "tools/tarnweb/song_server.h"
 
 namespace {
@@ -66,6 +67,9 @@ int main(int argc, char **argv)
         bool ok = true;
         if (a == "--help" || a == "-h") {
             Usage(stdout);
+            return 0;
+        } else if (a == "--version") {
+            printf("tarnweb %s\n", TARN_VERSION);
             return 0;
         } else if (a == "--verbose") {
             options.verbose = true;
