@@ -95,6 +95,13 @@ int Send(const ControlRequest &request, std::string *reply)
     if (connect(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) != 0) {
         int err = errno;
         close(fd);
+        if (err == EACCES) {
+            fprintf(stderr,
+                    "tarnctl: permission denied: %s belongs to the group set by audio_group in\n"
+                    "%s; ask to be added to that group.\n",
+                    path.c_str(), TarnPath(TARN_INFO_CONF).c_str());
+            return 1;
+        }
         fprintf(stderr,
                 "tarnctl: tarnaudiod is not running (cannot connect to %s: %s).\n"
                 "Start it with scripts/run.sh, or run build/bin/tarnaudiod as root.\n",
@@ -448,6 +455,9 @@ int Watch(int argc, char **argv)
         return 1;
     }
     void *p = shmat(id, nullptr, SHM_RDONLY);
+    if (p == reinterpret_cast<void *>(-1) && errno == EACCES)
+        return Fail("permission denied: the status segment belongs to the group set by audio_group in %s",
+                    TarnPath(TARN_INFO_CONF).c_str());
     if (p == reinterpret_cast<void *>(-1))
         return Fail("cannot attach the status segment: %s", strerror(errno));
     const PublishedStatusShm *seg = static_cast<const PublishedStatusShm *>(p);
