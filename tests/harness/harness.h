@@ -4,7 +4,8 @@
 // (TARN_ROOT, TARN_SHM_KEY from the pid, TARN_LOG_FILE=<root>/log.txt,
 // TARN_AUDIO_OUT=null unless set), so in-process client code and started
 // programs share the root. The root's folders and mplayer-daemon (when built)
-// come from the install rules (scripts/make-root.sh). The process becomes a child subreaper (the daemonized tarnaudiod is
+// come from the install rules (scripts/make-root.sh). The process becomes a
+// child subreaper (the daemonized tarnaudiod is
 // reaped here) and ignores SIGPIPE. Nothing is started outside a private
 // network namespace (scripts/netns-run). Only one Harness at a time.
 #ifndef TARN_TEST_HARNESS_H
