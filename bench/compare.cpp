@@ -277,13 +277,11 @@ struct Ours {
 void StartOurs(Ours &o, const std::string &base)
 {
     o.root = base + "/ours";
-    for (const char *d : {"/tmp", "/var/run", "/etc", "/usr/tarn/bin", "/usr/tarn/etc/audio",
-                          "/usr/tarn/etc.defaults/audio"})
-        MkdirP(o.root + d);
     std::string bin = TARN_BIN_DIR;
-    if (symlink((bin + "/mplayer-daemon").c_str(), (o.root + "/usr/tarn/bin/mplayer-daemon").c_str()) != 0 &&
-        errno != EEXIST)
-        Die("cannot link mplayer-daemon into the private root");
+    // Laid out by the install rules, as every root is.
+    if (Run(std::string("'") + TARN_SOURCE_DIR + "/scripts/make-root.sh' --build '" + TARN_BUILD_DIR +
+            "' --component player '" + o.root + "'") != 0)
+        Die("cannot lay out the private root " + o.root + " (scripts/make-root.sh)");
     o.sock = o.root + "/tmp/tarnaudiod.sock";
     o.shmKey = 0x5a000000 + (getpid() & 0xffff) * 4;
     o.wav = base + "/ours.wav";

@@ -10,9 +10,11 @@
 #include <fcntl.h>
 #include <string>
 #include <poll.h>
+#include <sys/stat.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include "daemon/access.h"
 #include "daemon/globals.h"
 #include "daemon/shm.h"
 #include "daemon/socket.h"
@@ -25,6 +27,9 @@
 #include "upnp/upnp.h"
 
 static const char kLogUnit[] = "tarnaudiod";
+
+// Set by --foreground (DaemonSetForeground).
+static int g_foreground = 0;
 
 namespace {
 
@@ -348,7 +353,7 @@ int DaemonInit()
         TarnLog("%s:%d Audio daemon already exists. Pid[%d]", kLogUnit, 67, pid);
         exit(0);
     }
-    if (daemon(0, 0) != 0) {
+    if (!g_foreground && daemon(0, 0) != 0) {
         printf("Failed to daemon()\n");
         fflush(stdout);
         TarnLog("%s:%d Failed to daemon()", kLogUnit, 75);
@@ -362,24 +367,40 @@ int DaemonInit()
         TarnLog("%s:%d Failed to setup signal handler.", kLogUnit, 86);
         return -1;
     }
+    if (g_foreground)
+        signal(SIGINT, DaemonOnSigterm);
     return 0;
+}
+
+void DaemonSetForeground(int on)
+{
+    g_foreground = on;
+    TarnLogToStderr(on != 0);
 }
 
 int DaemonStart(DaemonContext &ctx)
 {
     std::string mplayerPath = TarnPath(TARN_MPLAYER_SOCKET);
+    // The player socket is the daemon user's alone; the control socket and
+    // the segments are shared with the audio group.
+    gid_t group = AccessGroup();
+    mode_t mask = umask(ACCESS_MPLAYER_UMASK);
     ctx.mplayerListenFd = SocketListen(mplayerPath.c_str(), 1);
+    umask(mask);
     if (ctx.mplayerListenFd == -1) {
         TarnLog("%s:%d Failed to init socket %s, %m", kLogUnit, 456, mplayerPath.c_str());
         return -1;
     }
     fcntl(ctx.mplayerListenFd, F_SETFD, FD_CLOEXEC);
     std::string ctrlPath = TarnPath(TARN_CTRL_SOCKET);
+    mask = umask(ACCESS_CTRL_UMASK);
     ctx.ctrlListenFd = SocketListen(ctrlPath.c_str(), 5);
+    umask(mask);
     if (ctx.ctrlListenFd == -1) {
         TarnLog("%s:%d Failed to init socket %s, %m", kLogUnit, 462, ctrlPath.c_str());
         return -1;
     }
+    AccessShareSocket(ctrlPath.c_str(), group);
     fcntl(ctx.ctrlListenFd, F_SETFD, FD_CLOEXEC);
     fcntl(ctx.ctrlListenFd, F_SETFL, fcntl(ctx.ctrlListenFd, F_GETFL) | O_NONBLOCK);
     ctx.controller = new UpnpController();
@@ -401,6 +422,8 @@ int DaemonStart(DaemonContext &ctx)
         TarnLog("%s:%d Failed to create shared memory. (%m)", kLogUnit, 490);
         return -1;
     }
+    AccessShareSegment(ctx.playerShm, TarnShmKeyPlayer(), group);
+    AccessShareSegment(ctx.publishedShm, TarnShmKeyPublished(), group);
     // Devices already on the network answer the short searches within a
     // second; the long ones are the searches of old.
     ctx.controller->SearchQuick();

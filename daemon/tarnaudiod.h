@@ -44,6 +44,10 @@ int DaemonSetupSignals();
 // file, signals. 0 or -1.
 int DaemonInit();
 
+// Foreground: DaemonInit does not detach, every log message also goes to
+// standard error, and SIGINT (Ctrl-C) stops the daemon like SIGTERM.
+void DaemonSetForeground(int on);
+
 // Sockets, controller, local player, segments, the two searches. 0 or -1
 // (what was created stays in ctx for DaemonShutdown).
 int DaemonStart(DaemonContext &ctx);

@@ -9,9 +9,20 @@
 #include <syslog.h>
 #include <unistd.h>
 
+namespace {
+bool g_toStderr = false;
+const char *g_ident = "";
+}  // namespace
+
 void TarnLogOpen(const char *ident)
 {
+    g_ident = ident;
     openlog(ident, LOG_PID, LOG_DAEMON);
+}
+
+void TarnLogToStderr(bool on)
+{
+    g_toStderr = on;
 }
 
 void TarnLogV(const char *fmt, va_list ap)
@@ -40,6 +51,11 @@ void TarnLogV(const char *fmt, va_list ap)
     vsnprintf(buf, sizeof(buf), f.c_str(), copy);
     va_end(copy);
     syslog(LOG_ERR, "%s", buf);
+    if (g_toStderr) {
+        std::string line = std::string(g_ident) + ": " + buf + "\n";
+        ssize_t w = write(STDERR_FILENO, line.data(), line.size());
+        (void)w;
+    }
     const std::string &file = TarnLogFile();
     if (!file.empty()) {
         int fd = open(file.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);

@@ -17,6 +17,10 @@ void TarnLogV(const char *fmt, va_list ap);
 // Opens syslog with the program's identity (call once at start-up).
 void TarnLogOpen(const char *ident);
 
+// On: every message is also written to standard error as "ident: text"
+// (programs running attached, e.g. under a service manager).
+void TarnLogToStderr(bool on);
+
 // Each source file that uses TLOG defines: static const char kLogUnit[] = "unit";
 #define TLOG(fmt, ...) TarnLog("%s:%d " fmt, kLogUnit, __LINE__, ##__VA_ARGS__)
 

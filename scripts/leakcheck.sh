@@ -51,12 +51,11 @@ cleanup() {
 }
 trap cleanup EXIT
 
-for d in tmp var/run etc usr/tarn/bin usr/tarn/var usr/tarn/etc/audio/radio usr/tarn/etc.defaults/audio share/Music dev; do
-    mkdir -p "$ROOT/$d"
-done
-cp "$B/bin/mplayer-daemon" "$ROOT/usr/tarn/bin/mplayer-daemon"
-cp "$SRC"/data/equalizer.system "$ROOT/usr/tarn/etc.defaults/audio/" 2>/dev/null
-cp "$SRC"/data/radio/*.asx "$ROOT/usr/tarn/etc/audio/" 2>/dev/null
+# The root comes from the install rules (the sanitized mplayer-daemon, the
+# equalizer profiles and radio seeds); the configuration is the check's own.
+"$SRC/scripts/make-root.sh" --build "$B" --component player --component data "$ROOT" ||
+    { echo "leakcheck: cannot lay out the root"; exit 1; }
+mkdir -p "$ROOT/share/Music" "$ROOT/dev"
 printf 'audio_volume="50"\nadmin_port=8080\n' > "$ROOT/etc/tarninfo.conf"
 step() { echo "leakcheck: $*"; }
 

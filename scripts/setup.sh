@@ -11,7 +11,8 @@ gstreamer1.0-libav gstreamer1.0-alsa
 libtag1-dev libsqlite3-dev sqlite3 libcurl4-openssl-dev libcpp-httplib-dev libssl-dev
 lame flac vorbis-tools sox iproute2 procps util-linux python3 curl
 gmediarender rygel rygel-playbin minidlna mpd
-chromium chromium-driver python3-selenium"
+chromium chromium-driver python3-selenium
+systemd man-db bash-completion dpkg-dev fakeroot debootstrap"
 if [ "$(id -u)" != "0" ]; then
     echo "setup.sh must run as root to install packages. Run:"
     echo "  sudo apt-get update && sudo apt-get install -y $(echo $PKGS)"

@@ -10,6 +10,7 @@
 #include <fstream>
 #include <fcntl.h>
 #include <poll.h>
+#include <spawn.h>
 #include <sys/ipc.h>
 #include <sys/prctl.h>
 #include <sys/shm.h>
@@ -201,13 +202,27 @@ void Harness::PrepareRoot()
     if (root.empty())
         return;
     EmptyDir(root);
-    for (const char *d : {"/tmp", "/var/run", "/etc", "/usr/tarn/bin", "/usr/tarn/etc/audio",
-                          "/usr/tarn/etc.defaults/audio"})
-        MakeDirs(root + d);
-    std::string mplayer = BinPath("mplayer-daemon");
-    std::error_code ec;
-    if (access(mplayer.c_str(), X_OK) == 0)
-        std::filesystem::copy_file(mplayer, Path(TARN_MPLAYER_BIN), ec);
+    // The folders and mplayer-daemon, laid out by the install rules like
+    // every other root (scripts/make-root.sh); the profiles, radio seeds and
+    // configuration are left to each test.
+    std::vector<std::string> argv = {SourcePath("scripts/make-root.sh"), "--build", TARN_BUILD_DIR};
+    if (access(BinPath("mplayer-daemon").c_str(), X_OK) == 0) {
+        argv.push_back("--component");
+        argv.push_back("player");
+    } else {
+        argv.push_back("--component");
+        argv.push_back("none");
+    }
+    argv.push_back(root);
+    std::vector<char *> args;
+    for (std::string &a : argv)
+        args.push_back(&a[0]);
+    args.push_back(nullptr);
+    pid_t pid = -1;
+    int status = -1;
+    if (posix_spawn(&pid, args[0], nullptr, nullptr, args.data(), environ) != 0 ||
+        waitpid(pid, &status, 0) != pid || !WIFEXITED(status) || WEXITSTATUS(status) != 0)
+        error = "scripts/make-root.sh failed for " + root;
 }
 
 int Harness::WriteFile(const char *fixedPath, const std::string &content) const

@@ -3,8 +3,9 @@
 // empties it and lays out the standard folders); the environment is set once
 // (TARN_ROOT, TARN_SHM_KEY from the pid, TARN_LOG_FILE=<root>/log.txt,
 // TARN_AUDIO_OUT=null unless set), so in-process client code and started
-// programs share the root. mplayer-daemon, when built, is copied under the
-// root. The process becomes a child subreaper (the daemonized tarnaudiod is
+// programs share the root. The root's folders and mplayer-daemon (when built)
+// come from the install rules (scripts/make-root.sh). The process becomes a
+// child subreaper (the daemonized tarnaudiod is
 // reaped here) and ignores SIGPIPE. Nothing is started outside a private
 // network namespace (scripts/netns-run). Only one Harness at a time.
 #ifndef TARN_TEST_HARNESS_H

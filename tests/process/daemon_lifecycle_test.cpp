@@ -138,26 +138,7 @@ TEST_F(LifecycleTest, ShutdownZeroesTheSegmentsAndRestartReattaches)
     EXPECT_EQ(0, h.Stop());
 }
 
-TEST_F(LifecycleTest, TooSmallExistingSegmentStopsTheStart)
-{
-    for (int which = 0; which < 2; ++which) {
-        SCOPED_TRACE(which);
-        h.RemoveSegments();
-        h.ClearLog();
-        int key = which == 0 ? h.PlayerKey() : h.PublishedKey();
-        ASSERT_EQ(0, tarntest::Harness::CreateSegment(key, 64));
-        EXPECT_EQ(0, h.Launch());
-        EXPECT_EQ(0, h.WaitAllChildren(15000));
-        for (const auto &r : h.Reaped())
-            EXPECT_TRUE(WIFEXITED(r.second) && WEXITSTATUS(r.second) == 0) << r.first;
-        EXPECT_TRUE(h.WaitLog(kExit));
-        EXPECT_EQ(1, h.CountLog(kExit));
-        EXPECT_EQ(1, h.CountLog(std::string("tarnaudiod:") + (which == 0 ? "483" : "490") +
-                                " Failed to create shared memory. (")) << h.Log();
-        EXPECT_EQ(1, h.CountLog("shm:35 Failed to create shared memory. key[" + std::to_string(key) + "], size["));
-        EXPECT_FALSE(h.Exists(TARN_PID_FILE));
-        EXPECT_FALSE(h.Exists(TARN_CTRL_SOCKET));
-    }
-}
+// A segment too small to attach is refused before the daemon detaches
+// (program_options_test).
 
 }  // namespace

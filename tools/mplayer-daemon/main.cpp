@@ -13,6 +13,7 @@
 #include "daemon/tarn_types.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
+#include "platform/tarn_version.h"
 #include "tools/mplayer-daemon/command_parser.h"
 #include "tools/mplayer-daemon/playbin_player.h"
 #include "tools/mplayer-daemon/status_segment.h"
@@ -227,6 +228,25 @@ gboolean OnQuitSignal(gpointer p)
 
 int main(int argc, char **argv)
 {
+    // --help, --version and unknown double-dash options are answered before
+    // anything happens; single-dash options the daemon may pass are ignored.
+    for (int i = 1; i < argc; ++i) {
+        if (!strcmp(argv[i], "--help") || !strcmp(argv[i], "-h")) {
+            printf("usage: mplayer-daemon [URI] [-loop N] [-daemon] [-volume N] [-af equalizer=G1:...:G10]\n"
+                   "       mplayer-daemon --help | --version\n"
+                   "The player process of tarnaudiod: plays URI, takes commands on /tmp/mplayer.sock\n"
+                   "and reports in the player status segment. See mplayer-daemon(8).\n");
+            return 0;
+        }
+        if (!strcmp(argv[i], "--version") || !strcmp(argv[i], "-V")) {
+            printf("mplayer-daemon %s\n", TARN_VERSION);
+            return 0;
+        }
+        if (!strncmp(argv[i], "--", 2)) {
+            fprintf(stderr, "mplayer-daemon: unknown option '%s' (see --help)\n", argv[i]);
+            return 2;
+        }
+    }
     TarnLogOpen("mplayer-daemon");
     signal(SIGPIPE, SIG_IGN);
 

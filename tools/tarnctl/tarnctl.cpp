@@ -32,13 +32,11 @@
 #include "daemon/tarn_types.h"
 #include "platform/media_playlists.h"
 #include "platform/tarn_env.h"
+#include "platform/tarn_version.h"
 #include "tools/tarnctl/client.h"
 #include "tools/tarnctl/library.h"
 #include "tools/tarnctl/text.h"
 
-#ifndef TARNCTL_VERSION
-#define TARNCTL_VERSION "1.0"
-#endif
 
 namespace fs = std::filesystem;
 
@@ -1815,7 +1813,7 @@ int main(int argc, char **argv)
             PrintList(stdout);
             return 0;
         } else if (opt == "--version" || opt == "-V") {
-            printf("tarnctl %s\n", TARNCTL_VERSION);
+            printf("tarnctl %s\n", TARN_VERSION);
             return 0;
         } else {
             fprintf(stderr, "tarnctl: unknown option '%s'\n", argv[i]);

@@ -1,6 +1,6 @@
 // tarnlib: builds and inspects the appliance's media library.
 //
-//   tarnlib [--db FILE] scan DIR
+//   tarnlib [--db FILE] scan [DIR...]     (no DIR: the folders of music_dir)
 //   tarnlib [--db FILE] songs
 //   tarnlib [--db FILE] playlists
 //   tarnlib [--db FILE] playlist show PATH
@@ -22,12 +22,17 @@
 
 #include "platform/media_playlists.h"
 #include "platform/medialib.h"
+#include "daemon/tarn_types.h"
+#include "platform/tarn_env.h"
+#include "platform/tarn_version.h"
+#include "platform/tlibc_conf.h"
 
-static void Usage()
+static void Usage(FILE *out = stderr)
 {
-    fprintf(stderr,
+    fprintf(out,
             "usage: tarnlib [--db FILE] COMMAND\n"
-            "  scan DIR                       add, update and remove the songs and playlists of DIR\n"
+            "  scan [DIR...]                  add, update and remove the songs and playlists of each\n"
+            "                                 DIR (default: the music_dir folders of tarninfo.conf)\n"
             "  songs                          list the songs of the library\n"
             "  playlists                      list the saved playlists\n"
             "  playlist show PATH             list the songs of a saved playlist\n"
@@ -109,6 +114,51 @@ static int CmdScan(const char *dir)
     for (const std::string &w : r.warnings)
         printf("warning: %s\n", w.c_str());
     return 0;
+}
+
+// The folders of "music_dir" in the configuration, separated by ':'.
+static std::vector<std::string> MusicDirs()
+{
+    std::vector<std::string> dirs;
+    char value[4096] = "";
+    std::string conf = TarnPath(TARN_INFO_CONF);
+    if (TLIBCFileGetKeyValue(conf.c_str(), "music_dir", value, sizeof(value), 0) <= 0)
+        return dirs;
+    std::string all(value);
+    size_t start = 0;
+    while (start <= all.size()) {
+        size_t end = all.find(':', start);
+        if (end == std::string::npos)
+            end = all.size();
+        std::string dir = all.substr(start, end - start);
+        while (!dir.empty() && (dir.back() == ' ' || dir.back() == '\t'))
+            dir.pop_back();
+        size_t lead = dir.find_first_not_of(" \t");
+        if (lead != std::string::npos && !dir.empty())
+            dirs.push_back(dir.substr(lead));
+        start = end + 1;
+    }
+    return dirs;
+}
+
+// Scans each folder given, or those of music_dir; 1 when any failed.
+static int CmdScanAll(int argc, char **argv)
+{
+    std::vector<std::string> dirs(argv, argv + argc);
+    if (dirs.empty()) {
+        dirs = MusicDirs();
+        if (dirs.empty()) {
+            fprintf(stderr, "tarnlib: no music folder: give one (tarnlib scan DIR) or set music_dir in %s\n",
+                    TarnPath(TARN_INFO_CONF).c_str());
+            return 2;
+        }
+    }
+    int rc = 0;
+    for (const std::string &dir : dirs) {
+        if (CmdScan(dir.c_str()) != 0)
+            rc = 1;
+    }
+    return rc;
 }
 
 static int CmdSongs()
@@ -275,9 +325,13 @@ int main(int argc, char **argv)
             MediaLibSetDefaultPath(argv[i + 1]);
             i += 2;
         } else if (strcmp(argv[i], "-h") == 0 || strcmp(argv[i], "--help") == 0) {
-            Usage();
+            Usage(stdout);
+            return 0;
+        } else if (strcmp(argv[i], "-V") == 0 || strcmp(argv[i], "--version") == 0) {
+            printf("tarnlib %s\n", TARN_VERSION);
             return 0;
         } else {
+            fprintf(stderr, "tarnlib: unknown option '%s'\n", argv[i]);
             Usage();
             return 2;
         }
@@ -289,8 +343,8 @@ int main(int argc, char **argv)
     std::string cmd = argv[i];
     int rest = argc - i - 1;
     char **args = argv + i + 1;
-    if (cmd == "scan" && rest == 1)
-        return CmdScan(args[0]);
+    if (cmd == "scan")
+        return CmdScanAll(rest, args);
     if (cmd == "songs" && rest == 0)
         return CmdSongs();
     if (cmd == "playlists" && rest == 0)

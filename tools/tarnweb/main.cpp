@@ -27,6 +27,7 @@
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"
+#include "platform/tarn_version.h"
 #include "tools/tarnweb/song_server.h"
 #include "tools/tarnweb/web_remote.h"
 
@@ -77,6 +78,9 @@ int main(int argc, char **argv)
         bool ok = true;
         if (a == "--help" || a == "-h") {
             Usage(stdout);
+            return 0;
+        } else if (a == "--version") {
+            printf("tarnweb %s\n", TARN_VERSION);
             return 0;
         } else if (a == "--verbose") {
             options.verbose = true;
