@@ -10,9 +10,16 @@
 # names the failed stages and the exit status is non-zero if any failed.
 #   scripts/test.sh            everything
 #   scripts/test.sh --quick    stage 1 and 2 only
+#   scripts/test.sh --package  only the Debian package test (fetches Debian's
+#                              packages from the mirror into a cached root)
 cd "$(dirname "$0")/.." || exit 1
 QUICK=0
 [ "$1" = "--quick" ] && QUICK=1
+if [ "$1" = "--package" ]; then
+    cmake -S . -B build -DTARN_PACKAGE_TEST=ON > build.cmake.log 2>&1 || { cat build.cmake.log; exit 1; }
+    cmake --build build -j"${TARN_JOBS:-2}" || exit 1
+    cd build && exec ctest --output-on-failure -L package
+fi
 JOBS=${TARN_JOBS:-2}
 failed=""
 
