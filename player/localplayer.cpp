@@ -3,6 +3,7 @@
 // following its reports in the player status segment.
 #include "player/localplayer.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
@@ -77,6 +78,7 @@ LocalPlayer::LocalPlayer()
       volume(50),
       errorCount(0),
       failSerialSeen(0),
+      failedInARow(0),
       muted(false)
 {
     int stored = VolumeConfGet();
@@ -122,6 +124,7 @@ int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     case ACT_PREVIOUS:
         // A play request starts afresh: earlier errors are history.
         lastError.clear();
+        failedInARow = 0;
         break;
     default:
         break;
@@ -511,16 +514,29 @@ int LocalPlayer::Poll(PlayerStatusShm *segment)
         std::string why = FieldText(segment->failReason, sizeof(segment->failReason));
         if (!why.empty())
             SetError(why);
+        ++failedInARow;
     }
 
     int32_t reported = shm->state;
     if (reported == 0)
         return 0;
     state = static_cast<uint32_t>(reported);
+    if (reported == PLAYER_STATE_PLAYING && position > 0)
+        failedInARow = 0;
     if (reported == PLAYER_STATE_ENDED) {
         // Written back so that the end of this song is handled once.
         shm->state = PLAYER_STATE_PLAYING;
-        Next(true);
+        // Every song of the queue failed in turn (a dead station, a queue of
+        // vanished files with repeat on): stop instead of trying them again
+        // and again; the last error tells why.
+        if (failedInARow > 0 && failedInARow >= std::max(1u, playlist->Count())) {
+            TLOG("No song of the queue could be played (%u failed in a row); stopping", failedInARow);
+            failedInARow = 0;
+            Stop();
+            state = PLAYER_STATE_STOPPED;
+        } else {
+            Next(true);
+        }
     }
 
     time_t now = time(nullptr);

@@ -85,6 +85,7 @@ private:
     std::string lastError;
     int32_t errorCount;
     int32_t failSerialSeen;  // mplayer-daemon's failure reports already taken
+    unsigned failedInARow;   // songs that failed since one last played
     bool muted;              // as mplayer-daemon last reported it
     void SetError(const std::string &why);
 };

@@ -53,6 +53,19 @@ const char *StateText(int s)
     }
 }
 
+// AVTransport's "Transition not available" fault, and how often and how
+// soon a Play refused with it is sent again.
+const int kTransitionNotAvailable = 701;
+const int kPlayRetries = 5;
+const long long kPlayRetryDelayMs = 250;
+
+long long MonotonicMs()
+{
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+}
+
 }  // namespace
 
 UpnpPlayer::UpnpPlayer(UpnpController *controller, int rendererIndex)
@@ -73,7 +86,10 @@ UpnpPlayer::UpnpPlayer(UpnpController *controller, int rendererIndex)
       nextRefused(false),
       playingReportsAtStart(0),
       goneSince(0),
-      wasSelected(false)
+      wasSelected(false),
+      playRetries(0),
+      retryPlayAtMs(0),
+      retryKind(JOB_NONE)
 {
     if (!controller || rendererIndex < 0 ||
         controller->GetRenderer(static_cast<unsigned>(rendererIndex), &renderer) != 0 || !renderer) {
@@ -237,6 +253,8 @@ int UpnpPlayer::PlayCurrent()
                                                {"0", url, metadata}));
     steps.push_back(UpnpController::MakeAction("Play", {"InstanceID", "Speed"}, {"0", "1"}));
     playStarted = 0;
+    playRetries = 0;
+    retryPlayAtMs = 0;
     nextUrl.clear();
     nextDirty = false;
     nextRefused = false;
@@ -268,6 +286,7 @@ void UpnpPlayer::FinishJob(RENDERER_INFO *r)
     case JOB_PLAY:
     case JOB_REPLAY:
         if (ok) {
+            playRetries = 0;
             playingUrl = url.empty() ? playingUrl : url;
             SetState(PLAYER_STATE_PLAYING);
             playStarted = 1;
@@ -275,6 +294,16 @@ void UpnpPlayer::FinishJob(RENDERER_INFO *r)
             // played.
             if (!r->transport_events)
                 playingReportsAtStart = r->playing_reports;
+            break;
+        }
+        if (r->job_failed == "Play" && r->job_error == kTransitionNotAvailable &&
+            playRetries < kPlayRetries) {
+            // Still between two states (loading the song, say): Play is
+            // sent again shortly.
+            ++playRetries;
+            retryPlayAtMs = MonotonicMs() + kPlayRetryDelayMs;
+            retryKind = kind;
+            jobUrl = url;
             break;
         }
         if (kind == JOB_REPLAY) {
@@ -375,6 +404,7 @@ int UpnpPlayer::Stop()
 {
     // After whatever is in flight, so that a Play on its way cannot follow.
     controller->CancelJob();
+    retryPlayAtMs = 0;
     std::vector<RendererAction> steps;
     steps.push_back(UpnpController::MakeAction("Stop", {"InstanceID"}, {"0"}));
     int r = StartJob(JOB_STOP, steps, std::string());
@@ -593,6 +623,15 @@ int UpnpPlayer::Poll()
         return -1;
     renderer = r;
 
+    if (retryPlayAtMs != 0 && jobKind == JOB_NONE && MonotonicMs() >= retryPlayAtMs) {
+        retryPlayAtMs = 0;
+        std::vector<RendererAction> steps;
+        steps.push_back(UpnpController::MakeAction("Play", {"InstanceID", "Speed"}, {"0", "1"}));
+        if (StartJob(retryKind, steps, jobUrl) != 0) {
+            lastError = "The renderer did not take Play";
+            SetState(PLAYER_STATE_STOPPED);
+        }
+    }
     if (jobKind != JOB_NONE && r->job_done == static_cast<uint32_t>(jobId)) {
         FinishJob(r);
     } else if (jobKind != JOB_NONE && time(nullptr) - jobStarted > kJobGiveUpSeconds) {

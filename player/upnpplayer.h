@@ -88,6 +88,11 @@ private:
     time_t goneSince;  // when the renderer left; 0 while it is there
     bool wasSelected;
     std::string lastError;
+    // Play refused with 701 (the renderer still between two states): sent
+    // again a little later, a few times, before it counts as a failure.
+    int playRetries;
+    long long retryPlayAtMs;  // 0: none due
+    int retryKind;
 };
 
 #endif

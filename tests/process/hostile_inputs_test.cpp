@@ -13,6 +13,8 @@
 #include "daemon/tarn_types.h"
 #include "platform/json_read.h"
 #include "source/radiolist.h"
+#include <unistd.h>
+
 #include "tests/harness/harness.h"
 
 namespace {
@@ -146,6 +148,34 @@ TEST(QueueLimit, SongsPastTheLimitAreRefusedWithAReason)
     ASSERT_TRUE(Json::Reader().parse(reply, v)) << reply;
     EXPECT_FALSE(v.isMember("error")) << reply;
     EXPECT_EQ(0, h.Stop());
+}
+
+// A queue where nothing can be played (streams that refuse the connection),
+// with Repeat One and Repeat All: each song is tried once, then the player
+// stops with the reason, instead of trying them again every second.
+TEST(UnplayableQueue, EverySongFailingStopsThePlayerWithTheReason)
+{
+    for (const char *mode : {"2", "3"}) {
+        SCOPED_TRACE(std::string("repeat mode ") + mode);
+        tarntest::Harness h;
+        ASSERT_EQ(0, h.Start()) << h.Error();
+        for (const char *url : {"http://127.0.0.1:9/gone-a.mp3", "http://127.0.0.1:9/gone-b.mp3"})
+            ASSERT_EQ(0, h.QueueAdd(tarntest::MakeMediaInfo(url)));
+        ASSERT_EQ(0, h.Request(ACT_SET_REPEAT_MODE, mode));
+        ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "0"));
+        EXPECT_TRUE(h.WaitLog("No song of the queue could be played", 20000)) << h.Log();
+        std::string reply;
+        Json::Value v;
+        ASSERT_EQ(0, h.Request(ACT_GET_STATUS, "", &reply));
+        ASSERT_TRUE(Json::Reader().parse(reply, v)) << reply;
+        EXPECT_NE(std::string::npos, v["last_error"].asString().find("127.0.0.1:9/gone-")) << reply;
+        int tries = h.CountLog("Failed to play [");
+        usleep(3000 * 1000);
+        EXPECT_EQ(tries, h.CountLog("Failed to play [")) << "the player kept trying";
+        EXPECT_LE(tries, 3) << h.Log();
+        EXPECT_NE(PLAYER_STATE_PLAYING, h.PublishedSegment()->state);
+        EXPECT_EQ(0, h.Stop());
+    }
 }
 
 }  // namespace

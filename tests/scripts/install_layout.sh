@@ -64,7 +64,8 @@ fi
 # --- every key the code reads is in the shipped configuration and its page ---
 KEYS=$( (grep -rhoE '(TLIBCFileGetKeyValue|TLIBCFileSetKeyValue)\([^,]+, *"[a-z0-9_]+"' "$S"/daemon "$S"/player \
             "$S"/source "$S"/audio "$S"/platform "$S"/upnp "$S"/tools | grep -oE '"[a-z0-9_]+"$'
-         grep -rhoE 'ConfNumber\("[a-z0-9_]+"' "$S"/source "$S"/platform | grep -oE '"[a-z0-9_]+"'
+         grep -rhoE 'ConfNumber\("[a-z0-9_]+"' "$S"/source "$S"/platform "$S"/upnp "$S"/player "$S"/daemon | grep -oE '"[a-z0-9_]+"'
+         grep -rhoE 'ConfValue\([^,]+, *"[a-z0-9_]+"' "$S"/tools | grep -oE '"[a-z0-9_]+"$'
          grep -rhoE 'kKey[A-Za-z]*\[\] = "[a-z0-9_]+"' "$S"/audio | grep -oE '"[a-z0-9_]+"'
          grep -rhoE 'ConfKey[A-Za-z]*\("[a-z0-9_]+"' "$S"/platform "$S"/tools "$S"/daemon | grep -oE '"[a-z0-9_]+"'
        ) | tr -d '"' | sort -u)

@@ -26,8 +26,8 @@ class MediaLib;
 struct SongServerOptions {
     std::string bindAddress = "0.0.0.0";
     int port = 0;              // 0: any free port
-    int threads = 32;          // worker threads (requests served at once)
-    int perClient = 8;         // connections of one client address at once
+    int threads = 64;          // worker threads (requests served at once)
+    int perClient = 16;        // connections of one client address at once
     int writeTimeoutSec = 60;  // a client that reads nothing for this long is dropped
     std::string dbPath;        // media library database
     bool verbose = false;      // one line per request on stderr
