@@ -84,7 +84,7 @@ cmake --install "$B" --prefix "$P" > "$T/install2.log" 2>&1 || fail "second cmak
 grep -q '^audio_volume="17"$' "$P/etc/tarninfo.conf" || fail "reinstall overwrote a changed tarninfo.conf"
 ok "reinstall keeps tarninfo.conf"
 
-# --- bash completion -----------------------------------------------------------
+# --- bash completion and tarnctl(1) follow the program ------------------------
 BC=/usr/share/bash-completion/bash_completion
 if [ -f "$BC" ] && command -v bash > /dev/null; then
     got=$(bash -c ". $BC; . $P/share/bash-completion/completions/tarnctl
@@ -96,8 +96,60 @@ if [ -f "$BC" ] && command -v bash > /dev/null; then
         COMP_WORDS=(tarnlib --db x s); COMP_CWORD=3; COMP_LINE='tarnlib --db x s'; COMP_POINT=16
         _tarnlib; echo \"\${COMPREPLY[*]}\"" 2>&1)
     [ "$(echo "$got" | sed -n 1p)" = "repeat" ] || fail "tarnctl completion of 'rep': $got"
-    [ "$(echo "$got" | sed -n 2p)" = "normal one all cycle" ] || fail "tarnctl completion after repeat: $got"
+    [ "$(echo "$got" | sed -n 2p)" = "off one all" ] || fail "tarnctl completion after repeat: $got"
     [ "$(echo "$got" | sed -n 3p)" = "scan songs smart" ] || fail "tarnlib completion of 's': $got"
+
+    # Every command of "tarnctl --help" is completed and has its entry in
+    # tarnctl(1); commands whose arguments are only fixed words (repeat
+    # [off|one|all], discover servers|renderers, select local|N|NAME ...)
+    # complete exactly those words; sub-commands and files are offered.
+    # ls completes the library's folders: a library with two of them.
+    MANWIDTH=200 man -l "$P/share/man/man1/tarnctl.1" 2> /dev/null | sed -n '/^COMMANDS/,/^FORMAT/p' > "$T/tarnctl.man"
+    mkdir -p "$T/files/Some Folder" && : > "$T/files/song one.flac"
+    L=$T/libroot
+    mkdir -p "$L/usr/tarn/var" "$T/music/Jazz/Blue Train" "$T/music/Rock"
+    "$S/scripts/make-demo-songs.sh" "$T/music/Jazz/Blue Train" 1 > /dev/null 2>&1
+    "$S/scripts/make-demo-songs.sh" "$T/music/Rock" 1 > /dev/null 2>&1
+    TARN_ROOT=$L "$P/bin/tarnlib" scan "$T/music" > /dev/null || fail "tarnlib scan of $T/music"
+    TARN_ROOT=$L PATH=$P/bin:$PATH bash -c '
+        . "$1"; . "$2"
+        ask() {  # ask WORD... CURRENT: the completions offered for CURRENT
+            COMP_WORDS=(tarnctl "$@"); COMP_CWORD=$#
+            COMP_LINE="${COMP_WORDS[*]}"; COMP_POINT=${#COMP_LINE}
+            COMPREPLY=(); _tarnctl; echo "${COMPREPLY[*]}"
+        }
+        n=0
+        all=" $(ask "") "
+        while read -r name args; do
+            n=$((n + 1))
+            [[ $all == *" $name "* ]] || echo "FAIL: tarnctl completion does not offer the command $name"
+            grep -Eq "^       ([a-z]+ \| )?$name( |\$)" "$3" || echo "FAIL: tarnctl(1) has no entry for $name"
+            w=${args#[}; w=${w%]}
+            if [[ -n $w && $w =~ ^[a-zA-Z]+(\|[a-zA-Z]+)+$ ]]; then
+                want=$(tr "|" "\n" <<< "$w" | grep -v "^[A-Z]*$" | tr "\n" " ")
+                [[ "$(ask "$name" "") " == "$want" ]] ||
+                    echo "FAIL: tarnctl completion after $name: [$(ask "$name" "")], usage says [$want]"
+            fi
+        done < <(tarnctl --help | sed -n "s/^  \([a-z][a-z]*\)\( \(.*\)\)\{0,1\}\$/\1 \3/p" |
+                 sed "s/  .*//")
+        [ "$n" -ge 30 ] || echo "FAIL: found only $n commands in tarnctl --help"
+        [ "$(ask slot "")" = "save load list" ] || echo "FAIL: slot: $(ask slot "")"
+        [ "$(ask slot load "")" = "1 2 3 4 5 6 7 8 9" ] || echo "FAIL: slot load: $(ask slot load "")"
+        [ "$(ask source custom "")" = "1 2 3 4 5 6 7 8 9" ] || echo "FAIL: source custom: $(ask source custom "")"
+        [ "$(ask source "")" = "random radio ipod playlist next prev custom" ] || echo "FAIL: source: $(ask source "")"
+        [ "$(ask search "")" = "any artist album title" ] || echo "FAIL: search: $(ask search "")"
+        [ "$(ask random "")" = "on off toggle" ] || echo "FAIL: alias random: $(ask random "")"
+        [ "$(ask --json --timeout 500 sh)" = "shuffle" ] || echo "FAIL: after options: $(ask --json --timeout 500 sh)"
+        [ "$(ask -)" = "--json --timeout --help --version" ] || echo "FAIL: options: $(ask -)"
+        [ "$(ask watch --)" = "--json --help --count --interval" ] || echo "FAIL: watch options: $(ask watch --)"
+        [ "$(ask add "$4/so")" = "$4/song one.flac" ] || echo "FAIL: add FILE: $(ask add "$4/so")"
+        [ "$(ask queue insert 2 "$4/So")" = "$4/Some Folder" ] || echo "FAIL: queue insert: $(ask queue insert 2 "$4/So")"
+        [ -z "$(ask insert "$4/so")" ] || echo "FAIL: insert completes a file where POS belongs"
+        [ "$(ask ls "$4/S")" = "$4/Some Folder" ] || echo "FAIL: ls /PATH: $(ask ls "$4/S")"
+        [ "$(ask ls "")" = "Jazz/ Rock/" ] || echo "FAIL: ls: $(ask ls "")"
+        [ "$(ask ls --add Jazz/B)" = "Jazz/Blue Train/" ] || echo "FAIL: ls Jazz/B: $(ask ls --add Jazz/B)"
+    ' sh "$BC" "$P/share/bash-completion/completions/tarnctl" "$T/tarnctl.man" "$T/files" > "$T/comp.txt" 2>&1
+    while read -r line; do fail "${line#FAIL: }"; done < "$T/comp.txt"
     ok "bash completion"
 else
     echo "SKIP: bash-completion is not installed (scripts/setup.sh installs it)"
@@ -121,7 +173,7 @@ done
 DAEMON=$(cat "$R/var/run/tarnaudiod.pid" 2>/dev/null)
 [ -n "$DAEMON" ] || fail "installed tarnaudiod did not start: $(cat "$T/daemon.out" "$R/log.txt" 2>/dev/null)"
 "$R/usr/bin/tarnctl" add "$SONG" > /dev/null || fail "tarnctl add"
-"$R/usr/bin/tarnctl" play 0 > /dev/null || fail "tarnctl play 0"
+"$R/usr/bin/tarnctl" play 1 > /dev/null || fail "tarnctl play 1"
 i=0
 while :; do
     MP=$(cat "$R/var/run/mplayer.daemon.pid" 2>/dev/null)
