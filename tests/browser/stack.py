@@ -67,7 +67,7 @@ class Stack:
                 shutil.copy(os.path.join(SRC, 'data/radio', f), os.path.join(self.root, 'usr/tarn/etc/audio', f))
         self.music = os.path.join(self.root, 'music')
         with open(self.conf_path(), 'w') as f:
-            f.write('admin_port=%d\nmedia_folder=%s\n%s' % (self.port, self.music, conf_extra))
+            f.write('admin_port=%d\nmusic_dir=%s\n%s' % (self.port, self.music, conf_extra))
         if songs:
             self.run(['sh', os.path.join(SRC, 'scripts/make-demo-songs.sh'), self.music, str(song_seconds)])
             self.run([os.path.join(self.bin, 'tarnlib'), 'scan', self.music])

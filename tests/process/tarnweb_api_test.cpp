@@ -192,7 +192,7 @@ TEST_F(WebApiTest, LibraryBrowseSearchCoverAndRescan)
     // A cover image in the songs' folder serves as their cover art.
     std::string jpeg = std::string("\xff\xd8\xff\xe0", 4) + std::string(200, 'j');
     ASSERT_EQ(0, h.WriteFile("/music/cover.jpg", jpeg));
-    StartAll("media_folder=" + h.Path("/music") + "\n");
+    StartAll("music_dir=" + h.Path("/music") + "\n");
     Answer a = Call("/api/library/artists");
     ASSERT_EQ(200, a.status);
     ASSERT_EQ(1u, a.json["artists"].size());

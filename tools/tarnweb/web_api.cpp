@@ -671,16 +671,28 @@ void WebRemote::RegisterApi(httplib::Server &server)
     });
     server.Get("/api/library/scan", [this](Req, Res res) { Reply(res, library->ScanState()); });
     server.Post("/api/library/rescan", [this](Req, Res res) {
-        std::string folder = ConfValue(options.confPath, "media_folder");
-        if (folder.empty())
-            folder = library->SongFolder();
-        if (folder.empty())
-            return Error(res, 409, "no music folder known: set media_folder in " + options.confPath);
+        // The folders of music_dir (separated by ':'), else the library's own.
+        std::vector<std::string> folders;
+        std::string dirs = ConfValue(options.confPath, "music_dir");
+        for (size_t at = 0; at <= dirs.size();) {
+            size_t end = dirs.find(':', at);
+            if (end == std::string::npos)
+                end = dirs.size();
+            if (end > at)
+                folders.push_back(dirs.substr(at, end - at));
+            at = end + 1;
+        }
+        if (folders.empty() && !library->SongFolder().empty())
+            folders.push_back(library->SongFolder());
+        if (folders.empty())
+            return Error(res, 409, "no music folder known: set music_dir in " + options.confPath);
         StatusHub *h = hub.get();
-        if (library->StartScan(folder, [h](const Json::Value &state) { h->Publish("scan", Compact(state)); }) != 0)
+        if (library->StartScan(folders, [h](const Json::Value &state) { h->Publish("scan", Compact(state)); }) != 0)
             return Error(res, 409, "a scan is running already");
         Json::Value v(Json::objectValue);
-        v["folder"] = folder;
+        v["folder"] = folders[0];
+        for (const std::string &f : folders)
+            v["folders"].append(f);
         Ok(res, v);
     });
 

@@ -408,7 +408,8 @@ std::string LibraryView::SongFolder()
     return common.empty() ? "/" : common;
 }
 
-int LibraryView::StartScan(const std::string &folder, std::function<void(const Json::Value &)> progress)
+int LibraryView::StartScan(const std::vector<std::string> &folders,
+                           std::function<void(const Json::Value &)> progress)
 {
     std::lock_guard<std::mutex> lock(scanMutex);
     if (scanning)
@@ -418,19 +419,24 @@ int LibraryView::StartScan(const std::string &folder, std::function<void(const J
     scanning = true;
     scanState = Json::Value(Json::objectValue);
     scanState["running"] = true;
-    scanState["folder"] = folder;
+    std::string names;
+    for (const std::string &f : folders)
+        names += (names.empty() ? "" : ":") + f;
+    scanState["folder"] = names;
     scanState["done"] = 0;
     scanState["total"] = 0;
     std::string path = dbPath;
-    scanner = std::thread([this, folder, path, progress] {
+    scanner = std::thread([this, folders, names, path, progress] {
         MediaLib lib;
-        ScanReport report;
+        ScanReport report, total;
         Json::Value state(Json::objectValue);
-        state["folder"] = folder;
+        state["folder"] = names;
         int r = lib.Open(path, true);
         int64_t lastSent = 0;
-        if (r == 0) {
-            r = lib.Scan(folder, &report, [&](int done, int total) {
+        // One folder after the other, as tarnlib scan does.
+        for (size_t i = 0; r == 0 && i < folders.size(); ++i) {
+            report = ScanReport();
+            r = lib.Scan(folders[i], &report, [&](int done, int total) {
                 int64_t now = std::chrono::duration_cast<std::chrono::milliseconds>(
                                   std::chrono::steady_clock::now().time_since_epoch())
                                   .count();
@@ -448,7 +454,13 @@ int LibraryView::StartScan(const std::string &folder, std::function<void(const J
                     progress(p);
                 }
             });
+            total.seen += report.seen;
+            total.added += report.added;
+            total.updated += report.updated;
+            total.removed += report.removed;
+            total.failed += report.failed;
         }
+        report = total;
         state["running"] = false;
         state["ok"] = r == 0;
         if (r != 0)

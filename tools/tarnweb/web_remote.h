@@ -182,7 +182,7 @@ public:
     int Cover(uint32_t id, std::string *data, std::string *type, std::string *etag);
 
     // Rescan of folder in the background; -1 when one runs already.
-    int StartScan(const std::string &folder, std::function<void(const Json::Value &)> progress);
+    int StartScan(const std::vector<std::string> &folders, std::function<void(const Json::Value &)> progress);
     Json::Value ScanState();
     // The folders of the library: the common folder of its songs.
     std::string SongFolder();
