@@ -263,6 +263,48 @@ int MediaLib::DeleteSmart(const std::string &name)
     return sqlite3_changes(db_) > 0 ? 1 : 0;
 }
 
+namespace {
+// One value bound to a smart playlist's query.
+struct Bind {
+    bool numeric;
+    std::string text;
+};
+
+// The SQL condition of one checked rule, made only of fixed fragments chosen
+// from the field and operator tables; its values are appended to binds.
+std::string RuleCondition(const SmartRule &r, std::vector<Bind> *binds)
+{
+    const FieldDef *f = FindField(r.field);
+    std::string col = f->column;
+    std::string cond;
+    bool num = f->numeric;
+    if (r.op == "is" || r.op == "isnot") {
+        cond = col + (r.op == "is" ? " = ?" : " <> ?") + (num ? "" : " COLLATE NOCASE");
+        binds->push_back({num, r.value});
+    } else if (r.op == "contains" || r.op == "startswith") {
+        std::string esc;
+        for (char c : r.value) {
+            if (c == '%' || c == '_' || c == '\\')
+                esc += '\\';
+            esc += c;
+        }
+        cond = "CAST(" + col + " AS TEXT) LIKE ? ESCAPE '\\'";
+        binds->push_back({false, (r.op == "contains" ? "%" : "") + esc + "%"});
+    } else if (r.op == "from") {
+        cond = col + " BETWEEN ? AND ?";
+        binds->push_back({true, r.value});
+        binds->push_back({true, r.value2});
+    } else if (r.op == "above") {
+        cond = col + " > ?";
+        binds->push_back({true, r.value});
+    } else {
+        cond = col + " < ?";
+        binds->push_back({true, r.value});
+    }
+    return cond;
+}
+}  // namespace
+
 int MediaLib::SmartSongs(const SmartPlaylist &list, std::vector<MediaSong> *songs, int start, int limit,
                          int *total)
 {
@@ -273,10 +315,6 @@ int MediaLib::SmartSongs(const SmartPlaylist &list, std::vector<MediaSong> *song
     // The SQL text is made only of fixed fragments chosen from the field and
     // operator tables; every value is bound as a parameter.
     std::string where;
-    struct Bind {
-        bool numeric;
-        std::string text;
-    };
     std::vector<Bind> binds;
     for (const SmartRule &r : list.rules) {
         std::string why;
@@ -285,33 +323,7 @@ int MediaLib::SmartSongs(const SmartPlaylist &list, std::vector<MediaSong> *song
             TLOG("%s", error_.c_str());
             return -1;
         }
-        const FieldDef *f = FindField(r.field);
-        std::string col = f->column;
-        std::string cond;
-        bool num = f->numeric;
-        if (r.op == "is" || r.op == "isnot") {
-            cond = col + (r.op == "is" ? " = ?" : " <> ?") + (num ? "" : " COLLATE NOCASE");
-            binds.push_back({num, r.value});
-        } else if (r.op == "contains" || r.op == "startswith") {
-            std::string esc;
-            for (char c : r.value) {
-                if (c == '%' || c == '_' || c == '\\')
-                    esc += '\\';
-                esc += c;
-            }
-            cond = "CAST(" + col + " AS TEXT) LIKE ? ESCAPE '\\'";
-            binds.push_back({false, (r.op == "contains" ? "%" : "") + esc + "%"});
-        } else if (r.op == "from") {
-            cond = col + " BETWEEN ? AND ?";
-            binds.push_back({true, r.value});
-            binds.push_back({true, r.value2});
-        } else if (r.op == "above") {
-            cond = col + " > ?";
-            binds.push_back({true, r.value});
-        } else {
-            cond = col + " < ?";
-            binds.push_back({true, r.value});
-        }
+        std::string cond = RuleCondition(r, &binds);
         if (!where.empty())
             where += list.matchAny ? " OR " : " AND ";
         where += "(" + cond + ")";

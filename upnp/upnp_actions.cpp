@@ -276,6 +276,60 @@ std::string ActionNameOf(IXML_Document *request)
 
 }  // namespace
 
+// The answer to the job's action in flight: the next one goes out now.
+// Called under the lock.
+void UpnpController::OnJobAnswer(RENDERER_INFO *renderer, const UpnpActionComplete *event, int code)
+{
+    if (!renderer->job_sent.empty() &&
+        renderer->job_sent == ActionNameOf(UpnpActionComplete_get_ActionRequest(event))) {
+        std::string name = renderer->job_sent;
+        bool ours = renderer->job_sent_for == renderer->job_id;
+        renderer->job_sent.clear();
+        if (!ours) {
+            // The last action of a job that another one replaced: whatever
+            // its answer, the new job goes on.
+            SendJobStep(renderer);
+        } else if (code != UPNP_E_SUCCESS) {
+            renderer->job_steps.clear();
+            renderer->job_failed = name;
+            renderer->job_error = code;
+            renderer->job_done = renderer->job_id;
+        } else if (renderer->job_steps.empty()) {
+            renderer->job_error = 0;
+            renderer->job_done = renderer->job_id;
+        } else {
+            SendJobStep(renderer);
+        }
+        if (renderer->job_done == renderer->job_id)
+            Wake();
+    }
+}
+
+// Copies a GetPositionInfo or GetTransportInfo answer into the record.
+// Called under the lock.
+int UpnpController::OnActionResult(IXML_Document *result, RENDERER_INFO *renderer)
+{
+    if (result == nullptr) {
+        TLOG("action result is NULL");
+        return -1;
+    }
+    static const char *const kPositionTags[] = {"u:GetPositionInfoResponse",
+                                                 "m:GetPositionInfoResponse"};
+    static const char *const kTransportTags[] = {"u:GetTransportInfoResponse",
+                                                  "m:GetTransportInfoResponse"};
+    for (const char *tag : kPositionTags) {
+        IXML_Element *response = XmlGetDocElement(result, tag);
+        if (response != nullptr)
+            return UpdatePositionInfo(response, renderer);
+    }
+    for (const char *tag : kTransportTags) {
+        IXML_Element *response = XmlGetDocElement(result, tag);
+        if (response != nullptr)
+            return UpdateTransportInfo(response, renderer);
+    }
+    return 0;
+}
+
 int UpnpController::OnActionComplete(const UpnpActionComplete *event)
 {
     if (event == nullptr) {
@@ -324,50 +378,8 @@ int UpnpController::OnActionComplete(const UpnpActionComplete *event)
     }
     if (code != UPNP_E_SUCCESS)
         TLOG("Action Response not success, [%s]", UpnpGetErrorMessage(code));
-    // The answer to the job's action in flight: the next one goes out now.
-    if (!renderer->job_sent.empty() &&
-        renderer->job_sent == ActionNameOf(UpnpActionComplete_get_ActionRequest(event))) {
-        std::string name = renderer->job_sent;
-        bool ours = renderer->job_sent_for == renderer->job_id;
-        renderer->job_sent.clear();
-        if (!ours) {
-            // The last action of a job that another one replaced: whatever
-            // its answer, the new job goes on.
-            SendJobStep(renderer);
-        } else if (code != UPNP_E_SUCCESS) {
-            renderer->job_steps.clear();
-            renderer->job_failed = name;
-            renderer->job_error = code;
-            renderer->job_done = renderer->job_id;
-        } else if (renderer->job_steps.empty()) {
-            renderer->job_error = 0;
-            renderer->job_done = renderer->job_id;
-        } else {
-            SendJobStep(renderer);
-        }
-        if (renderer->job_done == renderer->job_id)
-            Wake();
-    }
-    IXML_Document *result = UpnpActionComplete_get_ActionResult(event);
-    if (result == nullptr) {
-        TLOG("action result is NULL");
-        return -1;
-    }
-    static const char *const kPositionTags[] = {"u:GetPositionInfoResponse",
-                                                 "m:GetPositionInfoResponse"};
-    static const char *const kTransportTags[] = {"u:GetTransportInfoResponse",
-                                                  "m:GetTransportInfoResponse"};
-    for (const char *tag : kPositionTags) {
-        IXML_Element *response = XmlGetDocElement(result, tag);
-        if (response != nullptr)
-            return UpdatePositionInfo(response, renderer);
-    }
-    for (const char *tag : kTransportTags) {
-        IXML_Element *response = XmlGetDocElement(result, tag);
-        if (response != nullptr)
-            return UpdateTransportInfo(response, renderer);
-    }
-    return 0;
+    OnJobAnswer(renderer, event, code);
+    return OnActionResult(UpnpActionComplete_get_ActionResult(event), renderer);
 }
 
 int UpnpController::UpdatePositionInfo(IXML_Element *response, RENDERER_INFO *renderer)

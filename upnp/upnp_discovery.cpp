@@ -331,30 +331,10 @@ void UpnpController::AddServer(IXML_Document *doc, const char *location)
     servers.insert(servers.begin() + static_cast<long>(position), server);
 }
 
-void UpnpController::AddRenderer(IXML_Document *doc, const char *location)
+// The control, event and description URLs and the type of each service of
+// a renderer's description.
+void UpnpController::ReadRendererServices(IXML_Document *doc, RENDERER_INFO *renderer)
 {
-    if (doc == nullptr || location == nullptr) {
-        TLOG("Bad parameter");
-        return;
-    }
-    RENDERER_INFO *renderer = new RENDERER_INFO();
-    renderer->udn = XmlGetDocElementText(doc, "UDN");
-    {
-        // Every announcement comes here; a listed renderer is not probed again.
-        ScopedLock lock(this);
-        if (FindRendererByUdn(renderer->udn) >= 0 ||
-            ListFull(renderers.size(), "renderers", renderer->udn)) {
-            delete renderer;
-            return;
-        }
-    }
-    renderer->friendly_name = XmlGetDocElementText(doc, "friendlyName");
-    if (ParseHttpUrl(location, renderer->ip, renderer->port) != 0) {
-        delete renderer;
-        return;
-    }
-    renderer->base_url = "http://" + renderer->ip + ":" + renderer->port;
-
     IXML_NodeList *services = ixmlDocument_getElementsByTagName(doc, "service");
     unsigned long count = services != nullptr ? ixmlNodeList_length(services) : 0;
     for (unsigned long i = 0; i < count; ++i) {
@@ -389,6 +369,33 @@ void UpnpController::AddRenderer(IXML_Document *doc, const char *location)
     }
     if (services != nullptr)
         ixmlNodeList_free(services);
+}
+
+void UpnpController::AddRenderer(IXML_Document *doc, const char *location)
+{
+    if (doc == nullptr || location == nullptr) {
+        TLOG("Bad parameter");
+        return;
+    }
+    RENDERER_INFO *renderer = new RENDERER_INFO();
+    renderer->udn = XmlGetDocElementText(doc, "UDN");
+    {
+        // Every announcement comes here; a listed renderer is not probed again.
+        ScopedLock lock(this);
+        if (FindRendererByUdn(renderer->udn) >= 0 ||
+            ListFull(renderers.size(), "renderers", renderer->udn)) {
+            delete renderer;
+            return;
+        }
+    }
+    renderer->friendly_name = XmlGetDocElementText(doc, "friendlyName");
+    if (ParseHttpUrl(location, renderer->ip, renderer->port) != 0) {
+        delete renderer;
+        return;
+    }
+    renderer->base_url = "http://" + renderer->ip + ":" + renderer->port;
+
+    ReadRendererServices(doc, renderer);
 
     // The two service descriptions are fetched without the lock, so that a
     // slow renderer never stalls the main loop or the other callbacks.
