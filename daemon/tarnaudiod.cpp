@@ -500,38 +500,10 @@ void WaitForWork(DaemonContext &ctx, std::vector<struct pollfd> &fds, size_t *co
 
 }  // namespace
 
-void DaemonLoopTurn(DaemonContext &ctx)
+// Renderer players: drop those whose renderer left, follow index moves,
+// poll the rest.
+static void PollRenderers(DaemonContext &ctx)
 {
-    std::vector<struct pollfd> fds;
-    size_t connsFirst = 0;
-    WaitForWork(ctx, fds, &connsFirst);
-
-    if (fds[1].revents) {
-        int fd = SocketAcceptPoll(ctx.mplayerListenFd);
-        if (fd >= 0)
-            ctx.localPlayer->AttachMplayerFd(fd);
-    }
-    // mplayer-daemon never writes on its connection: readable means closed.
-    if (fds[3].fd >= 0 && fds[3].fd == ctx.localPlayer->GetMplayerFd() && fds[3].revents) {
-        char byte;
-        ssize_t r = recv(fds[3].fd, &byte, 1, MSG_DONTWAIT);
-        if (r == 0 || (r < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR))
-            ctx.localPlayer->OnMplayerClosed();
-    }
-
-    ctx.conns.TakeReady(fds, connsFirst);
-    int ready = ctx.conns.NextReadable();
-    if (ready >= 0)
-        ServeRequest(ctx, ready);
-    ctx.conns.Service();
-    if (fds[2].revents)
-        ctx.conns.AcceptAll(ctx.ctrlListenFd);
-
-    // Local playback goes on while a renderer is selected.
-    ctx.localPlayer->Poll(ctx.playerShm);
-
-    // Renderer players: drop those whose renderer left, follow index moves,
-    // poll the rest.
     UpnpController *controller = ctx.controller;
     std::vector<UpnpPlayer *> &players = ctx.upnpPlayers;
     controller->Lock();
@@ -579,9 +551,12 @@ void DaemonLoopTurn(DaemonContext &ctx)
     if (!g_localSelected && g_selectedRenderer != -1)
         controller->SelectRenderer(static_cast<unsigned>(g_selectedRenderer));
     controller->Unlock();
+}
 
-    ctx.publishedShm->changed = g_changed;
-
+// The status of the selected player into the published segment.
+static void PublishSelected(DaemonContext &ctx)
+{
+    std::vector<UpnpPlayer *> &players = ctx.upnpPlayers;
     if (g_localSelected) {
         ctx.localPlayer->PublishStatus(ctx.publishedShm);
     } else if (g_selectedRenderer != -1) {
@@ -596,6 +571,43 @@ void DaemonLoopTurn(DaemonContext &ctx)
         memset(ctx.publishedShm, 0, TARN_SHM_PUBLISHED_SIZE);
         ctx.publishedShm->changed = changed;
     }
+}
+
+void DaemonLoopTurn(DaemonContext &ctx)
+{
+    std::vector<struct pollfd> fds;
+    size_t connsFirst = 0;
+    WaitForWork(ctx, fds, &connsFirst);
+
+    if (fds[1].revents) {
+        int fd = SocketAcceptPoll(ctx.mplayerListenFd);
+        if (fd >= 0)
+            ctx.localPlayer->AttachMplayerFd(fd);
+    }
+    // mplayer-daemon never writes on its connection: readable means closed.
+    if (fds[3].fd >= 0 && fds[3].fd == ctx.localPlayer->GetMplayerFd() && fds[3].revents) {
+        char byte;
+        ssize_t r = recv(fds[3].fd, &byte, 1, MSG_DONTWAIT);
+        if (r == 0 || (r < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR))
+            ctx.localPlayer->OnMplayerClosed();
+    }
+
+    ctx.conns.TakeReady(fds, connsFirst);
+    int ready = ctx.conns.NextReadable();
+    if (ready >= 0)
+        ServeRequest(ctx, ready);
+    ctx.conns.Service();
+    if (fds[2].revents)
+        ctx.conns.AcceptAll(ctx.ctrlListenFd);
+
+    // Local playback goes on while a renderer is selected.
+    ctx.localPlayer->Poll(ctx.playerShm);
+
+    PollRenderers(ctx);
+
+    ctx.publishedShm->changed = g_changed;
+
+    PublishSelected(ctx);
 }
 
 int DaemonShutdown(DaemonContext &ctx)

@@ -144,6 +144,16 @@ private:
     int Exec(const char *sql);
     int Fail(const char *what);
     int SetupSchema();
+    // The phases of Scan (medialib_scan.cpp), sharing one ScanState.
+    struct ScanState;
+    int ScanFindFiles(ScanState &st, ScanReport *report);
+    int ScanReadKnown(ScanState &st);
+    void ScanReadTags(ScanState &st, ScanReport *report,
+                      const std::function<void(int, int)> &progress, uint64_t maxFileSize);
+    int ScanWrite(ScanState &st, ScanReport *report);
+    int ScanWriteSongs(ScanState &st, ScanReport *report);
+    int ScanWritePlaylists(ScanState &st, ScanReport *report);
+    int ScanRollback(const char *what);
     sqlite3 *db_ = nullptr;
     std::string path_;
     std::string error_;

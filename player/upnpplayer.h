@@ -52,6 +52,7 @@ private:
     int Previous(bool automatic);
     int PlayIndex(const char *text);
     int Seek(const char *text);
+    void ChangeVolume(int code, const char *text);
     int GetStatusJson(Json::Value &reply);
     int StartJob(int kind, const std::vector<RendererAction> &steps, const std::string &url);
     void FinishJob(RENDERER_INFO *r);

@@ -154,16 +154,20 @@ public:
     static std::string ResolveUrl(const std::string &base, const std::string &relative);
 
 private:
-    // Discovery, removal, answers and events: see upnp.cpp.
+    // Discovery and removal: see upnp_discovery.cpp; answers: upnp_actions.cpp;
+    // events: upnp_events.cpp.
     friend struct UpnpControllerAccess;  // unit tests of the list rules
 
     int OnDiscovery(const UpnpDiscovery *event);
     void AddServer(IXML_Document *doc, const char *location);
     void AddRenderer(IXML_Document *doc, const char *location);
+    static void ReadRendererServices(IXML_Document *doc, RENDERER_INFO *renderer);
     int OnByeBye(const UpnpDiscovery *event);
     int RemoveServer(unsigned index);
     int RemoveRenderer(unsigned index);
     int OnActionComplete(const UpnpActionComplete *event);
+    void OnJobAnswer(RENDERER_INFO *renderer, const UpnpActionComplete *event, int code);
+    static int OnActionResult(IXML_Document *result, RENDERER_INFO *renderer);
     static int UpdatePositionInfo(IXML_Element *response, RENDERER_INFO *renderer);
     static int UpdateTransportInfo(IXML_Element *response, RENDERER_INFO *renderer);
     int OnSubscription(const UpnpEventSubscribe *event);

@@ -1,7 +1,11 @@
 // The remote's routes: the page, the JSON API and the live status stream.
 // Reads are GET; every change is a POST with a JSON body (or none) and is
 // answered {"ok":true,...} or, with a non-2xx status, {"error":"..."}
-// carrying what the daemon, the library or the radio lists reported.
+// carrying what the daemon, the library or the radio lists reported.//
+// This file: the shared helpers, the page, and the session and status
+// routes; the player, queue, device and equalizer routes are in
+// web_api_player.cpp, the library and source routes in web_api_library.cpp,
+// the radio routes in web_api_radio.cpp.
 #include <httplib.h>
 
 #include <algorithm>
@@ -17,18 +21,12 @@
 #include "platform/tlibc_conf.h"
 #include "source/radiolist.h"
 #include "tools/tarnweb/web_remote.h"
+#include "tools/tarnweb/web_api_util.h"
 
 static const char kLogUnit[] = "tarnweb";
 
-namespace {
+namespace webapi {
 
-const char kCoverFormat[] = "modules/Aurelon/webUI/getcover.cgi/ebdart/%lu.jpg";
-const char kPlaceholderArt[] = "modules/Aurelon/images/thumb/thumb_file.png";
-const char kEqSystem[] = "/usr/tarn/etc.defaults/audio/equalizer.system";
-const char kEqUser[] = "/usr/tarn/etc/audio/equalizer.user";
-const int kCustomSlots = 6;      // slots offered by the page: 1..6
-const size_t kMostSongsPerAdd = 2000;
-// The station list files are read, changed and written whole: one change at a time.
 std::mutex radioMutex;
 
 std::string Compact(const Json::Value &v)
@@ -39,7 +37,7 @@ std::string Compact(const Json::Value &v)
     return Json::writeString(b, v);
 }
 
-void Reply(httplib::Response &res, const Json::Value &v, int status = 200)
+void Reply(httplib::Response &res, const Json::Value &v, int status)
 {
     res.status = status;
     res.set_header("Cache-Control", "no-store");
@@ -53,7 +51,7 @@ void Error(httplib::Response &res, int status, const std::string &why)
     Reply(res, v, status);
 }
 
-void Ok(httplib::Response &res, const Json::Value &extra = Json::Value())
+void Ok(httplib::Response &res, const Json::Value &extra)
 {
     Json::Value v = extra.isObject() ? extra : Json::Value(Json::objectValue);
     v["ok"] = true;
@@ -106,8 +104,8 @@ int Param(const httplib::Request &req, const char *name, int fallback)
 
 // Sends one action; false after answering with the reason. A reply that
 // carries "error" (a full queue) counts as refused.
-bool Send(httplib::Response &res, int action, const std::string &text, Json::Value *reply = nullptr,
-          int timeoutMs = 3000)
+bool Send(httplib::Response &res, int action, const std::string &text, Json::Value *reply,
+          int timeoutMs)
 {
     Json::Value r;
     std::string error;
@@ -218,11 +216,6 @@ int QueuePage(int start, int limit, Json::Value *out, std::string *error)
     return -1;
 }
 
-struct EqProfile {
-    std::string name, gains;
-    bool user;
-};
-
 void ReadProfiles(const std::string &path, bool user, std::vector<EqProfile> *out)
 {
     std::ifstream in(path);
@@ -278,7 +271,9 @@ bool ValidStreamUrl(const std::string &url)
            url.size() < 4000 && url.find_first_of(" \r\n\t") == std::string::npos;
 }
 
-}  // namespace
+}  // namespace webapi
+
+using namespace webapi;
 
 WebRemote::WebRemote(const WebRemoteOptions &opts) : options(opts)
 {
@@ -364,6 +359,21 @@ void WebRemote::Register(httplib::Server &server)
 
 void WebRemote::RegisterApi(httplib::Server &server)
 {
+    RegisterSessionApi(server);
+    RegisterTransportApi(server);
+    RegisterQueueApi(server);
+    RegisterLibraryApi(server);
+    RegisterLibraryChangeApi(server);
+    RegisterSourceApi(server);
+    RegisterSourceListApi(server);
+    RegisterRadioApi(server);
+    RegisterRadioEditApi(server);
+    RegisterPlayersApi(server);
+    RegisterEqualizerApi(server);
+}
+
+void WebRemote::RegisterSessionApi(httplib::Server &server)
+{
     using Req = const httplib::Request &;
     using Res = httplib::Response &;
 
@@ -439,599 +449,5 @@ void WebRemote::RegisterApi(httplib::Server &server)
                 streams--;
                 hub->Subscribe(-1);
             });
-    });
-
-    // -- Transport -----------------------------------------------------------
-    static const std::pair<const char *, int> simple[] = {
-        {"play-pause", ACT_PLAY_PAUSE}, {"stop", ACT_STOP},          {"next", ACT_NEXT},
-        {"previous", ACT_PREVIOUS},     {"mute", ACT_MUTE},          {"volume-up", ACT_VOLUME_UP},
-        {"volume-down", ACT_VOLUME_DOWN}, {"shuffle", ACT_TOGGLE_SHUFFLE},
-    };
-    for (auto &s : simple) {
-        int action = s.second;
-        server.Post(std::string("/api/player/") + s.first, [this, action](Req, Res res) {
-            Json::Value r;
-            if (Send(res, action, "", &r)) {
-                hub->Kick();
-                Ok(res);
-            }
-        });
-    }
-    server.Post("/api/player/volume", [this](Req req, Res res) {
-        Json::Value body;
-        int v = 0;
-        if (!Body(req, res, &body))
-            return;
-        if (!IntField(body, "volume", 0, 100, &v))
-            return Error(res, 400, "volume: a number from 0 to 100");
-        if (Send(res, ACT_SET_VOLUME, std::to_string(v))) {
-            hub->Kick();
-            Ok(res);
-        }
-    });
-    server.Post("/api/player/seek", [this](Req req, Res res) {
-        Json::Value body;
-        int v = 0;
-        if (!Body(req, res, &body))
-            return;
-        if (!IntField(body, "position", 0, 24 * 3600 * 7, &v))
-            return Error(res, 400, "position: seconds from the start of the song");
-        if (Send(res, ACT_SEEK, std::to_string(v))) {
-            hub->Kick();
-            Ok(res);
-        }
-    });
-    server.Post("/api/player/repeat", [this](Req req, Res res) {
-        Json::Value body;
-        int mode = 0;
-        if (!Body(req, res, &body))
-            return;
-        if (!body.isMember("mode")) {
-            // Without a mode: the next one after the current (works on
-            // renderers too, which only take a mode).
-            Json::Value s;
-            Json::CharReaderBuilder rb;
-            std::unique_ptr<Json::CharReader> r(rb.newCharReader());
-            std::string text = hub->Current();
-            r->parse(text.data(), text.data() + text.size(), &s, nullptr);
-            mode = s.get("repeat", 1).asInt() % 3 + 1;
-        } else if (!IntField(body, "mode", 1, 3, &mode)) {
-            return Error(res, 400, "mode: 1 normal, 2 repeat one, 3 repeat all");
-        }
-        if (Send(res, ACT_SET_REPEAT_MODE, std::to_string(mode))) {
-            hub->Kick();
-            Json::Value v(Json::objectValue);
-            v["repeat"] = mode;
-            Ok(res, v);
-        }
-    });
-
-    // -- Queue -----------------------------------------------------------------
-    server.Get("/api/queue", [](Req req, Res res) {
-        int start = std::max(0, Param(req, "start", 0));
-        int limit = std::min(64, std::max(1, Param(req, "limit", 50)));
-        Json::Value r;
-        std::string error;
-        if (QueuePage(start, limit, &r, &error) != 0)
-            return Error(res, 503, error);
-        if (!r.isObject())
-            return Error(res, 409, "no player is selected");
-        Json::Value v(Json::objectValue);
-        v["start"] = start;
-        v["total"] = r.get("total", 0).asInt();
-        v["current"] = r.get("current", 0).asInt();
-        v["items"] = Json::Value(Json::arrayValue);
-        for (const Json::Value &u : r["uris"])
-            v["items"].append(QueueItem(u));
-        Reply(res, v);
-    });
-    static const std::pair<const char *, int> byIndex[] = {
-        {"play", ACT_PLAY_INDEX}, {"remove", ACT_QUEUE_REMOVE}};
-    for (auto &q : byIndex) {
-        int action = q.second;
-        server.Post(std::string("/api/queue/") + q.first, [this, action](Req req, Res res) {
-            Json::Value body;
-            int index = 0;
-            if (!Body(req, res, &body))
-                return;
-            if (!IntField(body, "index", 0, INT32_MAX, &index))
-                return Error(res, 400, "index: a queue position from 0");
-            if (Send(res, action, std::to_string(index))) {
-                hub->Kick();
-                Ok(res);
-            }
-        });
-    }
-    server.Post("/api/queue/clear", [this](Req, Res res) {
-        if (Send(res, ACT_QUEUE_CLEAR, "")) {
-            hub->Kick();
-            Ok(res);
-        }
-    });
-    // Moves an entry: removed, then inserted at its new place. "to": the
-    // place it takes in the new order; "next": right after the current song.
-    server.Post("/api/queue/move", [this](Req req, Res res) {
-        Json::Value body, page;
-        int from = 0, to = 0;
-        std::string error;
-        if (!Body(req, res, &body))
-            return;
-        if (!IntField(body, "from", 0, INT32_MAX, &from))
-            return Error(res, 400, "from: the queue position to move");
-        if (QueuePage(from, 1, &page, &error) != 0)
-            return Error(res, 503, error);
-        int total = page.get("total", 0).asInt(), current = page.get("current", 0).asInt();
-        if (!page["uris"].isArray() || page["uris"].empty() || from >= total)
-            return Error(res, 404, "no queue entry " + std::to_string(from));
-        if (body.get("next", false).asBool())
-            to = current < from ? current + 1 : current;
-        else if (!IntField(body, "to", 0, total - 1, &to))
-            return Error(res, 400, "to: a queue position from 0 to " + std::to_string(total - 1));
-        if (to == from)
-            return Ok(res);
-        TARN_MEDIA_INFO info = RecordFromItem(page["uris"][0]);
-        if (!Send(res, ACT_QUEUE_REMOVE, std::to_string(from)))
-            return;
-        bool ok = to >= total - 1 ? SendRecord(res, ACT_QUEUE_ADD, info, 0)
-                                  : SendRecord(res, ACT_QUEUE_INSERT, info, to);
-        hub->Kick();
-        if (ok)
-            Ok(res);
-    });
-
-    // -- Library ---------------------------------------------------------------
-    server.Get("/api/library/artists", [this](Req, Res res) {
-        Json::Value v(Json::objectValue), list;
-        std::string error;
-        if (library->Artists(&list, &error) != 0)
-            return Error(res, 503, error);
-        v["artists"] = list;
-        Reply(res, v);
-    });
-    server.Get("/api/library/albums", [this](Req req, Res res) {
-        Json::Value v(Json::objectValue), list;
-        std::string error;
-        if (library->Albums(req.get_param_value("artist"), req.has_param("artist"), &list, &error) != 0)
-            return Error(res, 503, error);
-        v["albums"] = list;
-        Reply(res, v);
-    });
-    server.Get("/api/library/songs", [this](Req req, Res res) {
-        Json::Value v(Json::objectValue);
-        std::string error;
-        if (library->Songs(req.get_param_value("artist"), req.has_param("artist"), req.get_param_value("album"),
-                           req.has_param("album"), Param(req, "start", 0), Param(req, "limit", 200), &v,
-                           &error) != 0)
-            return Error(res, 503, error);
-        Reply(res, v);
-    });
-    server.Get("/api/library/search", [this](Req req, Res res) {
-        Json::Value v(Json::objectValue);
-        std::string error, q = req.get_param_value("q");
-        if (q.empty())
-            return Error(res, 400, "q: the text to look for");
-        if (library->Search(q, req.get_param_value("field"), Param(req, "limit", 200), &v, &error) != 0)
-            return Error(res, 503, error);
-        Reply(res, v);
-    });
-    // Adds songs: {"ids":[...]} or every song of {"artist":..,"album":..};
-    // "where": "end" (default), "next" (after the current song) or "play"
-    // (after the current song, and play the first of them now).
-    server.Post("/api/library/add", [this](Req req, Res res) {
-        Json::Value body;
-        std::string error;
-        if (!Body(req, res, &body))
-            return;
-        std::vector<uint32_t> ids;
-        if (body["ids"].isArray()) {
-            for (const Json::Value &id : body["ids"])
-                if (id.isNumeric() && id.asLargestInt() > 0 && id.asLargestInt() <= UINT32_MAX)
-                    ids.push_back(static_cast<uint32_t>(id.asLargestUInt()));
-        } else if (body.isMember("artist") || body.isMember("album")) {
-            Json::Value list;
-            if (library->Songs(body.get("artist", "").asString(), body.isMember("artist"),
-                               body.get("album", "").asString(), body.isMember("album"), 0,
-                               static_cast<int>(kMostSongsPerAdd), &list, &error) != 0)
-                return Error(res, 503, error);
-            for (const Json::Value &s : list["songs"])
-                ids.push_back(s["id"].asUInt());
-        }
-        if (ids.empty() || ids.size() > kMostSongsPerAdd)
-            return Error(res, 400, "ids: 1 to " + std::to_string(kMostSongsPerAdd) + " song ids of the library");
-        std::vector<MediaSong> songs;
-        if (library->SongsById(ids, &songs, &error) != 0)
-            return Error(res, 503, error);
-        if (songs.empty())
-            return Error(res, 404, "none of these songs is in the library");
-        std::string where = body.get("where", "end").asString();
-        Json::Value page;
-        if (QueuePage(0, 1, &page, &error) != 0)
-            return Error(res, 503, error);
-        int total = page.get("total", 0).asInt(), current = page.get("current", 0).asInt();
-        int at = where == "end" || total == 0 ? total : current + 1;
-        for (size_t i = 0; i < songs.size(); ++i) {
-            TARN_MEDIA_INFO info;
-            MediaSongToInfo(songs[i], &info);
-            SetCover(&info);
-            int pos = at + static_cast<int>(i);
-            bool ok = pos >= total + static_cast<int>(i) ? SendRecord(res, ACT_QUEUE_ADD, info, 0)
-                                                         : SendRecord(res, ACT_QUEUE_INSERT, info, pos);
-            if (!ok) {
-                hub->Kick();
-                return;
-            }
-        }
-        if (where == "play" && !Send(res, ACT_PLAY_INDEX, std::to_string(at)))
-            return;
-        hub->Kick();
-        Json::Value v(Json::objectValue);
-        v["added"] = static_cast<int>(songs.size());
-        v["at"] = at;
-        Ok(res, v);
-    });
-    server.Get("/api/library/scan", [this](Req, Res res) { Reply(res, library->ScanState()); });
-    server.Post("/api/library/rescan", [this](Req, Res res) {
-        // The folders of music_dir (separated by ':'), else the library's own.
-        std::vector<std::string> folders;
-        std::string dirs = ConfValue(options.confPath, "music_dir");
-        for (size_t at = 0; at <= dirs.size();) {
-            size_t end = dirs.find(':', at);
-            if (end == std::string::npos)
-                end = dirs.size();
-            if (end > at)
-                folders.push_back(dirs.substr(at, end - at));
-            at = end + 1;
-        }
-        if (folders.empty() && !library->SongFolder().empty())
-            folders.push_back(library->SongFolder());
-        if (folders.empty())
-            return Error(res, 409, "no music folder known: set music_dir in " + options.confPath);
-        StatusHub *h = hub.get();
-        if (library->StartScan(folders, [h](const Json::Value &state) { h->Publish("scan", Compact(state)); }) != 0)
-            return Error(res, 409, "a scan is running already");
-        Json::Value v(Json::objectValue);
-        v["folder"] = folders[0];
-        for (const std::string &f : folders)
-            v["folders"].append(f);
-        Ok(res, v);
-    });
-
-    // -- Sources -----------------------------------------------------------------
-    server.Get("/api/sources", [](Req, Res res) {
-        Json::Value v(Json::objectValue);
-        v["slots"] = Json::Value(Json::arrayValue);
-        for (int slot = 1; slot <= kCustomSlots; ++slot) {
-            std::string type, second, third;
-            Json::Value s(Json::objectValue);
-            s["slot"] = slot;
-            if (TARNAudioCustomGet(slot, type, second, third) == 0) {
-                s["type"] = type;
-                s["name"] = type == "smart" ? second : (third.empty() ? second : third);
-            } else {
-                s["type"] = "";
-                s["name"] = "";
-            }
-            v["slots"].append(s);
-        }
-        std::vector<TARN_PLAYLIST_INFO> lists;
-        v["playlists"] = Json::Value(Json::arrayValue);
-        if (TARNPlaylistListAll(lists, 0, 0, 0) == 0)
-            for (auto &p : lists) {
-                Json::Value e(Json::objectValue);
-                e["path"] = p.path;
-                e["title"] = p.title;
-                v["playlists"].append(e);
-            }
-        int total = 0;
-        v["smart"] = Json::Value(Json::arrayValue);
-        for (const std::string &name : MediaServer::SmartPLSEnum(0, 0, total, nullptr))
-            v["smart"].append(name);
-        Reply(res, v);
-    });
-    server.Post("/api/source", [this](Req req, Res res) {
-        Json::Value body;
-        if (!Body(req, res, &body))
-            return;
-        static const std::pair<const char *, int> kinds[] = {
-            {"random", ACT_SOURCE_RANDOM},     {"radio", ACT_SOURCE_RADIO}, {"ipod", ACT_SOURCE_IPOD},
-            {"playlist", ACT_SOURCE_PLAYLIST}, {"next", ACT_SOURCE_NEXT},   {"previous", ACT_SOURCE_PREVIOUS},
-            {"custom", ACT_SOURCE_CUSTOM}};
-        std::string kind = body.get("kind", "").asString();
-        int action = 0, slot = 0;
-        for (auto &k : kinds)
-            if (kind == k.first)
-                action = k.second;
-        if (!action)
-            return Error(res, 400, "kind: random, radio, ipod, playlist, next, previous or custom");
-        if (action == ACT_SOURCE_CUSTOM && !IntField(body, "slot", 1, kCustomSlots, &slot))
-            return Error(res, 400, "slot: 1 to " + std::to_string(kCustomSlots));
-        // Fetching a radio list may take the daemon a while.
-        if (Send(res, action, action == ACT_SOURCE_CUSTOM ? std::to_string(slot) : "", nullptr, 20000)) {
-            hub->Kick();
-            Ok(res);
-        }
-    });
-    server.Post("/api/source/save", [this](Req req, Res res) {
-        Json::Value body;
-        int slot = 0;
-        if (!Body(req, res, &body))
-            return;
-        if (!IntField(body, "slot", 1, kCustomSlots, &slot))
-            return Error(res, 400, "slot: 1 to " + std::to_string(kCustomSlots));
-        if (Send(res, ACT_SAVE_CUSTOM, std::to_string(slot)))
-            Ok(res);
-    });
-    // Plays one saved ({"path":...}) or smart ({"smart":name}) playlist.
-    server.Post("/api/source/list", [this](Req req, Res res) {
-        Json::Value body;
-        if (!Body(req, res, &body))
-            return;
-        std::vector<TARN_MEDIA_INFO> songs;
-        if (body.isMember("path")) {
-            int count = 0;
-            std::string path = body["path"].asString();
-            std::vector<TARN_PLAYLIST_INFO> lists;
-            TARNPlaylistListAll(lists, 0, 0, 0);
-            if (std::none_of(lists.begin(), lists.end(), [&](const TARN_PLAYLIST_INFO &p) { return p.path == path; }))
-                return Error(res, 404, "no saved playlist " + path);
-            if (ParsePlayListByFieldGivenPath(path.c_str(), &count, 0, 0, "*", 1, songs) != 0)
-                return Error(res, 409, "the playlist has no playable song");
-        } else {
-            int total = 0;
-            std::vector<std::string> names = MediaServer::SmartPLSEnum(0, 0, total, nullptr);
-            auto it = std::find(names.begin(), names.end(), body.get("smart", "").asString());
-            if (it == names.end())
-                return Error(res, 404, "no smart playlist of that name");
-            std::list<TARN_MEDIA_INFO> list;
-            MediaServer::SmartPLSListSongs(static_cast<int>(it - names.begin()), 0, 0, total, list);
-            songs.assign(list.begin(), list.end());
-            if (songs.empty())
-                return Error(res, 409, "no song matches the smart playlist");
-        }
-        if (songs.size() > kMostSongsPerAdd)
-            songs.resize(kMostSongsPerAdd);
-        if (!Send(res, ACT_QUEUE_CLEAR, ""))
-            return;
-        for (TARN_MEDIA_INFO &info : songs) {
-            SetCover(&info);
-            if (!SendRecord(res, ACT_QUEUE_ADD, info, 0)) {
-                hub->Kick();
-                return;
-            }
-        }
-        if (Send(res, ACT_PLAY_INDEX, "0")) {
-            hub->Kick();
-            Ok(res);
-        }
-    });
-
-    // -- Radio -------------------------------------------------------------------
-    server.Get("/api/radio", [](Req req, Res res) {
-        int type = ListType(req.get_param_value("list"));
-        if (!type)
-            return Error(res, 400, "list: favorite or userdef");
-        Json::Value list;
-        if (RadioListGet(type, list) != 0)
-            return Error(res, 503, "the station list cannot be read");
-        Json::Value v(Json::objectValue);
-        v["stations"] = Json::Value(Json::arrayValue);
-        for (const Json::Value &s : list["stations"]) {
-            Json::Value e(Json::objectValue);
-            e["name"] = s.get("name", "").asString();
-            e["url"] = s.get("url", "").asString();
-            e["desc"] = s.get("desc", "").asString();
-            e["bitrate"] = s["bitrate"].isNumeric() ? s["bitrate"].asInt() : 0;
-            v["stations"].append(e);
-        }
-        v["total"] = list.get("total", 0).asInt();
-        Reply(res, v);
-    });
-    server.Post("/api/radio/play", [this](Req req, Res res) {
-        Json::Value body, list;
-        int index = 0;
-        if (!Body(req, res, &body))
-            return;
-        int type = ListType(body.get("list", "").asString());
-        if (!type || !IntField(body, "index", 0, INT32_MAX, &index))
-            return Error(res, 400, "list (favorite or userdef) and index of a station");
-        if (RadioListGet(type, list) != 0 || index >= static_cast<int>(list["stations"].size()))
-            return Error(res, 404, "no such station");
-        const Json::Value &station = list["stations"][index];
-        if (type == RADIO_LIST_FAVORITE && list.get("total", 0).asInt() != 0) {
-            // The radio source plays the favourites: the whole list is
-            // queued, so next and previous step through the stations.
-            if (!Send(res, ACT_SOURCE_RADIO, "", nullptr, 20000))
-                return;
-            if (index > 0 && !Send(res, ACT_PLAY_INDEX, std::to_string(index)))
-                return;
-        } else {
-            TARN_MEDIA_INFO info;
-            memset(&info, 0, sizeof(info));
-            snprintf(info.title, sizeof(info.title), "%s", station.get("name", "").asString().c_str());
-            snprintf(info.path, sizeof(info.path), "%s", station.get("url", "").asString().c_str());
-            if (!Send(res, ACT_QUEUE_CLEAR, "") || !SendRecord(res, ACT_QUEUE_ADD, info, 0) ||
-                !Send(res, ACT_PLAY_INDEX, "0"))
-                return;
-        }
-        hub->Kick();
-        Ok(res);
-    });
-    server.Post("/api/radio/add", [](Req req, Res res) {
-        std::lock_guard<std::mutex> lock(radioMutex);
-        Json::Value body;
-        if (!Body(req, res, &body))
-            return;
-        int type = ListType(body.get("list", "").asString());
-        std::string name = body.get("name", "").asString(), url = body.get("url", "").asString();
-        if (!type || name.empty() || name.size() > 254 || !ValidStreamUrl(url))
-            return Error(res, 400, "a station needs a name and an http(s) stream URL");
-        Json::Value stations(Json::arrayValue), s(Json::objectValue);
-        s["name"] = name;
-        s["url"] = url;
-        s["desc"] = body.get("desc", "").asString();
-        stations.append(s);
-        bool saved = false;
-        if (RadioListAdd(type, stations, &saved) != 0 || !saved)
-            return Error(res, 500, "the station list could not be saved");
-        Ok(res);
-    });
-    server.Post("/api/radio/rename", [](Req req, Res res) {
-        std::lock_guard<std::mutex> lock(radioMutex);
-        Json::Value body, list;
-        int index = 0;
-        if (!Body(req, res, &body))
-            return;
-        int type = ListType(body.get("list", "").asString());
-        std::string name = body.get("name", "").asString();
-        if (!type || !IntField(body, "index", 0, INT32_MAX, &index) || name.empty() || name.size() > 254)
-            return Error(res, 400, "list, index and a new name");
-        if (RadioListGet(type, list) != 0 || index >= static_cast<int>(list["stations"].size()))
-            return Error(res, 404, "no such station");
-        Json::Value s = list["stations"][index];
-        s["name"] = name;
-        if (!s.isMember("desc"))
-            s["desc"] = "";
-        if (body.isMember("url")) {
-            if (!ValidStreamUrl(body["url"].asString()))
-                return Error(res, 400, "url: an http(s) stream URL");
-            s["url"] = body["url"].asString();
-        }
-        bool saved = false;
-        if (RadioListEdit(type, static_cast<unsigned>(index), s, &saved) != 0 || !saved)
-            return Error(res, 500, "the station list could not be saved");
-        Ok(res);
-    });
-    server.Post("/api/radio/remove", [](Req req, Res res) {
-        std::lock_guard<std::mutex> lock(radioMutex);
-        Json::Value body, list;
-        int index = 0;
-        if (!Body(req, res, &body))
-            return;
-        int type = ListType(body.get("list", "").asString());
-        if (!type || !IntField(body, "index", 0, INT32_MAX, &index))
-            return Error(res, 400, "list and index of a station");
-        if (RadioListGet(type, list) != 0 || index >= static_cast<int>(list["stations"].size()))
-            return Error(res, 404, "no such station");
-        bool saved = false;
-        if (RadioListDelete(type, std::to_string(index), &saved) != 0 || !saved)
-            return Error(res, 500, "the station list could not be saved");
-        Ok(res);
-    });
-
-    // -- Players -----------------------------------------------------------------
-    server.Get("/api/players", [this](Req, Res res) {
-        Json::Value r, status;
-        std::string error;
-        if (WebDaemonAction(ACT_LIST_RENDERERS, "0 0", &r, &error) != 0)
-            return Error(res, 503, error);
-        Json::Value v(Json::objectValue);
-        v["renderers"] = Json::Value(Json::arrayValue);
-        for (const Json::Value &e : r["list"]) {
-            Json::Value p(Json::objectValue);
-            p["index"] = e.get("index", 0).asInt();
-            p["name"] = e.get("friendly_name", "").asString();
-            p["address"] = e.get("ip", "").asString();
-            v["renderers"].append(p);
-        }
-        Json::CharReaderBuilder rb;
-        std::unique_ptr<Json::CharReader> reader(rb.newCharReader());
-        std::string text = hub->Current();
-        reader->parse(text.data(), text.data() + text.size(), &status, nullptr);
-        v["selected"] = status["player"];
-        Reply(res, v);
-    });
-    server.Post("/api/players/select", [this](Req req, Res res) {
-        Json::Value body;
-        int index = 0;
-        if (!Body(req, res, &body))
-            return;
-        if (!IntField(body, "index", -1, 4096, &index))
-            return Error(res, 400, "index: -1 for this device, else a renderer's index");
-        if (!Send(res, ACT_SELECT_PLAYER, std::to_string(index)))
-            return;
-        std::string text = hub->Current();
-        Json::Value status;
-        Json::CharReaderBuilder rb;
-        std::unique_ptr<Json::CharReader> reader(rb.newCharReader());
-        reader->parse(text.data(), text.data() + text.size(), &status, nullptr);
-        if (status["player"].get("index", -2).asInt() != index)
-            return Error(res, 404, "that renderer is no longer on the network");
-        Ok(res);
-    });
-    server.Post("/api/players/refresh", [this](Req, Res res) {
-        if (Send(res, ACT_SEARCH_RENDERERS, ""))
-            Ok(res);
-    });
-
-    // -- Equalizer -----------------------------------------------------------------
-    server.Get("/api/equalizer", [this](Req, Res res) {
-        std::vector<EqProfile> profiles;
-        ReadProfiles(TarnPath(kEqSystem), false, &profiles);
-        ReadProfiles(TarnPath(kEqUser), true, &profiles);
-        Json::Value v(Json::objectValue);
-        v["profiles"] = Json::Value(Json::arrayValue);
-        for (auto &p : profiles) {
-            Json::Value e(Json::objectValue);
-            e["name"] = p.name;
-            e["gains"] = GainsJson(p.gains);
-            e["user"] = p.user;
-            v["profiles"].append(e);
-        }
-        v["enabled"] = ConfValue(options.confPath, "audio_enable_equalizer") == "yes";
-        v["current"] = ConfValue(options.confPath, "audio_default_equalizer");
-        Reply(res, v);
-    });
-    // {"name": profile} applies a profile and keeps it as the default;
-    // {"gains": [10 numbers]} applies gains; {"enabled": false} goes flat.
-    server.Post("/api/equalizer", [this](Req req, Res res) {
-        Json::Value body;
-        if (!Body(req, res, &body))
-            return;
-        float gains[10] = {0};
-        std::string name;
-        bool off = body.isMember("enabled") && !body["enabled"].asBool();
-        if (body.isMember("name") && !off) {
-            name = body["name"].asString();
-            char text[1024];
-            int found = EqProfileLookup(TarnPath(kEqSystem).c_str(), name.c_str(), text, sizeof(text));
-            if (found == 0)
-                found = EqProfileLookup(TarnPath(kEqUser).c_str(), name.c_str(), text, sizeof(text));
-            if (found != 1 || name.empty())
-                return Error(res, 404, "no equalizer profile " + name);
-            Json::Value g = GainsJson(text);
-            for (Json::ArrayIndex i = 0; i < g.size() && i < 10; ++i)
-                gains[i] = g[i].asFloat();
-        } else if (body["gains"].isArray() && !off) {
-            if (body["gains"].size() != 10)
-                return Error(res, 400, "gains: ten numbers from -12 to 12");
-            for (int i = 0; i < 10; ++i) {
-                const Json::Value &g = body["gains"][i];
-                if (!g.isNumeric() || g.asDouble() < -12 || g.asDouble() > 12)
-                    return Error(res, 400, "gains: ten numbers from -12 to 12");
-                gains[i] = g.asFloat();
-            }
-        } else if (!off) {
-            return Error(res, 400, "give a profile name, ten gains or enabled:false");
-        }
-        char text[256];
-        CtrlFormatEqualizer(gains, text, sizeof(text));
-        Json::Value status;
-        std::string s = hub->Current();
-        Json::CharReaderBuilder rb;
-        std::unique_ptr<Json::CharReader> reader(rb.newCharReader());
-        reader->parse(s.data(), s.data() + s.size(), &status, nullptr);
-        if (status["player"].get("kind", "").asString() == "renderer")
-            return Error(res, 409, "the equalizer works on this device's own output; select it first");
-        if (!Send(res, ACT_SET_EQUALIZER, text))
-            return;
-        if (!name.empty() || off) {
-            if (!name.empty() &&
-                TLIBCFileSetKeyValue(options.confPath.c_str(), "audio_default_equalizer", name.c_str(),
-                                     "%s=\"%s\"\n") != 0)
-                return Error(res, 500, "the profile was applied but could not be kept in " + options.confPath);
-            TLIBCFileSetKeyValue(options.confPath.c_str(), "audio_enable_equalizer", off ? "no" : "yes",
-                                 "%s=\"%s\"\n");
-        }
-        Ok(res);
     });
 }

@@ -187,6 +187,55 @@ int StatusHub::ReadSegment(PublishedStatusShm *out)
     return 0;
 }
 
+// What the segment does not tell: the daemon's status reply (player, radio,
+// mute, last error) and the current queue entry.
+static Json::Value DaemonExtra(const PublishedStatusShm &now, bool haveSegment)
+{
+    Json::Value x(Json::objectValue);
+    Json::Value status;
+    std::string error;
+    if (WebDaemonAction(ACT_GET_STATUS, "", &status, &error) != 0) {
+        x["daemon"] = false;
+        x["error"] = error;
+    } else {
+        x["daemon"] = true;
+        Json::Value player(Json::objectValue);
+        if (status.isObject() && status.isMember("RendererIndex")) {
+            player["kind"] = "renderer";
+            player["index"] = status["RendererIndex"].asInt();
+            player["name"] = status.get("RendererFriendlyName", "").asString();
+            if (status.isMember("playerMute"))
+                x["mute"] = status["playerMute"].asBool();
+        } else if (status.isObject()) {
+            player["kind"] = "local";
+            player["index"] = -1;
+            player["name"] = "This device";
+            x["radio"] = status.get("RadioStation", "").asString();
+            x["streamTitle"] = status.get("StreamTitle", "").asString();
+        } else {
+            player["kind"] = "none";
+            player["index"] = -1;
+            player["name"] = "No player (the selected renderer has gone)";
+        }
+        x["player"] = player;
+        std::string err;
+        if (status.isObject())
+            err = status.get("last_error", status.get("error", "").asString()).asString();
+        x["error"] = err;
+        Json::Value queue;
+        int index = haveSegment && now.currentUri[0] ? now.index : 0;
+        if (WebDaemonAction(ACT_QUEUE_LIST, std::to_string(index) + " 1", &queue, &error) == 0 &&
+            queue.isObject()) {
+            x["total"] = queue.get("total", 0).asInt();
+            x["current"] = queue.get("current", 0).asInt();
+            const Json::Value &uris = queue["uris"];
+            if (uris.isArray() && uris.size() > 0)
+                x["item"] = uris[0];
+        }
+    }
+    return x;
+}
+
 void StatusHub::Refresh(bool full)
 {
     std::lock_guard<std::mutex> refreshLock(refreshMutex);
@@ -201,49 +250,7 @@ void StatusHub::Refresh(bool full)
     if (haveLast && !full && !significant && memcmp(&now, &last, sizeof(now)) == 0)
         return;
     if (full || significant || extra.isNull()) {
-        Json::Value x(Json::objectValue);
-        Json::Value status;
-        std::string error;
-        if (WebDaemonAction(ACT_GET_STATUS, "", &status, &error) != 0) {
-            x["daemon"] = false;
-            x["error"] = error;
-        } else {
-            x["daemon"] = true;
-            Json::Value player(Json::objectValue);
-            if (status.isObject() && status.isMember("RendererIndex")) {
-                player["kind"] = "renderer";
-                player["index"] = status["RendererIndex"].asInt();
-                player["name"] = status.get("RendererFriendlyName", "").asString();
-                if (status.isMember("playerMute"))
-                    x["mute"] = status["playerMute"].asBool();
-            } else if (status.isObject()) {
-                player["kind"] = "local";
-                player["index"] = -1;
-                player["name"] = "This device";
-                x["radio"] = status.get("RadioStation", "").asString();
-                x["streamTitle"] = status.get("StreamTitle", "").asString();
-            } else {
-                player["kind"] = "none";
-                player["index"] = -1;
-                player["name"] = "No player (the selected renderer has gone)";
-            }
-            x["player"] = player;
-            std::string err;
-            if (status.isObject())
-                err = status.get("last_error", status.get("error", "").asString()).asString();
-            x["error"] = err;
-            Json::Value queue;
-            int index = haveSegment && now.currentUri[0] ? now.index : 0;
-            if (WebDaemonAction(ACT_QUEUE_LIST, std::to_string(index) + " 1", &queue, &error) == 0 &&
-                queue.isObject()) {
-                x["total"] = queue.get("total", 0).asInt();
-                x["current"] = queue.get("current", 0).asInt();
-                const Json::Value &uris = queue["uris"];
-                if (uris.isArray() && uris.size() > 0)
-                    x["item"] = uris[0];
-            }
-        }
-        extra = x;
+        extra = DaemonExtra(now, haveSegment);
         lastFullMs = NowMs();
     }
     last = now;

@@ -215,6 +215,18 @@ public:
 
 private:
     void RegisterApi(httplib::Server &server);
+    // Route groups of the JSON API, registered in this order by RegisterApi.
+    void RegisterSessionApi(httplib::Server &server);
+    void RegisterTransportApi(httplib::Server &server);
+    void RegisterQueueApi(httplib::Server &server);
+    void RegisterLibraryApi(httplib::Server &server);
+    void RegisterLibraryChangeApi(httplib::Server &server);
+    void RegisterSourceApi(httplib::Server &server);
+    void RegisterSourceListApi(httplib::Server &server);
+    void RegisterRadioApi(httplib::Server &server);
+    void RegisterRadioEditApi(httplib::Server &server);
+    void RegisterPlayersApi(httplib::Server &server);
+    void RegisterEqualizerApi(httplib::Server &server);
     WebRemoteOptions options;
     WebAssets assets;
     std::unique_ptr<WebGuard> guard;

@@ -1,0 +1,59 @@
+// Shared by the files of the renderer player (upnpplayer.cpp: songs, jobs
+// and actions; upnpplayer_poll.cpp: the loop's turn and the published
+// status): limits, job kinds and the UPnP transport state texts.
+#ifndef TARN_PLAYER_UPNPPLAYER_INTERNAL_H
+#define TARN_PLAYER_UPNPPLAYER_INTERNAL_H
+
+#include <time.h>
+
+#include "daemon/tarn_types.h"
+
+namespace upnpplayer_internal {
+
+const int kUrlSize = 4096;
+// A job without an ending after this long is given up.
+const int kJobGiveUpSeconds = 40;
+// The next song is handed to the renderer this long before the end.
+const int kHandNextBeforeEndSeconds = 2;
+
+// What the player's job does.
+enum {
+    JOB_NONE = 0,
+    JOB_PLAY,    // [Stop,] SetAVTransportURI, Play: the current song
+    JOB_REPLAY,  // Play: "Repeat One" at the end of the song
+    JOB_NEXT,    // SetNextAVTransportURI: the next song, handed ahead
+    JOB_STOP,    // Stop, in order after what is in flight
+};
+
+// AVTransport's "Transition not available" fault, and how often and how
+// soon a Play refused with it is sent again.
+const int kTransitionNotAvailable = 701;
+const int kPlayRetries = 5;
+const long long kPlayRetryDelayMs = 250;
+
+inline long long MonotonicMs()
+{
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+}
+
+inline const char *StateText(int s)
+{
+    switch (s) {
+    case PLAYER_STATE_STOPPED:
+        return "STOPPED";
+    case PLAYER_STATE_PLAYING:
+        return "PLAYING";
+    case PLAYER_STATE_PAUSED:
+        return "PAUSED_PLAYBACK";
+    case PLAYER_STATE_TRANSITIONING:
+        return "TRANSITIONING";
+    default:
+        return nullptr;
+    }
+}
+
+}  // namespace upnpplayer_internal
+
+#endif
