@@ -83,14 +83,14 @@ $SCAN
 $WEB > /tmp/web.out 2>&1 &
 i=0
 until tarnctl status > /dev/null 2>&1 || [ \$i -gt 100 ]; do i=\$((i + 1)); sleep 0.1; done
-tarnctl source random && tarnctl play 0 || echo "session: control failed"
+tarnctl source random && tarnctl play 1 || echo "session: control failed"
 i=0
 until tarnctl --json status | tr -d ' \n' | grep -q '"PlayerState":2,.*"Position":[1-9]' || [ \$i -gt 100 ]; do
     i=\$((i + 1)); sleep 0.1
 done
 tarnctl status
-echo "as anna: \$(setpriv --reuid=anna --regid=anna --init-groups tarnctl status 2>&1 | head -1)"
-echo "as nobody: \$(setpriv --reuid=nobody --regid=nogroup --clear-groups tarnctl status 2>&1 | head -1)"
+echo "as anna: \$(setpriv --reuid=anna --regid=anna --init-groups tarnctl status 2>&1 | grep -m1 '^\\[\\|tarnctl:')"
+echo "as nobody: \$(setpriv --reuid=nobody --regid=nogroup --clear-groups tarnctl status 2>&1 | grep -m1 '^\\[\\|tarnctl:')"
 kill -TERM \$(cat /var/run/tarnaudiod.pid) \$(pidof tarnweb)
 i=0
 while [ -e /var/run/tarnaudiod.pid ] && [ \$i -lt 100 ]; do i=\$((i + 1)); sleep 0.1; done
@@ -102,8 +102,8 @@ chmod +x "$R/tmp/session.sh"
     /tmp/session.sh > "$T/session.out" 2>&1
 cat "$T/session.out"
 grep -q "^Scanned /srv/music .*3 audio files, 3 added" "$T/session.out" || fail "the scan unit did not scan music_dir"
-grep -q "^local playing 0:0[1-9]" "$T/session.out" || fail "no song playing with the installed programs"
-grep -q "^as anna: local playing" "$T/session.out" || fail "a member of audio cannot use tarnctl"
+grep -q "^\[playing\] .* 0:0[1-9]/" "$T/session.out" || fail "no song playing with the installed programs"
+grep -q "^as anna: \[playing\]" "$T/session.out" || fail "a member of audio cannot use tarnctl"
 grep -q "^as nobody: tarnctl: permission denied" "$T/session.out" || fail "a non-member was not denied"
 grep -q "session:" "$T/session.out" && fail "session problems (above)"
 bytes=$(sed -n 's/^wav bytes: //p' "$T/session.out")

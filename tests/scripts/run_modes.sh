@@ -36,7 +36,7 @@ grep -q "^Scanned $M in .*3 audio files, 3 added" "$T/live" || fail "live mode: 
 grep -q "^music_dir=\"$M\"" "$ROOT/etc/tarninfo.conf" || fail "live mode: music_dir not set"
 grep -q "web remote: http://[0-9.]*:8580/" "$T/live" || fail "live mode: no web remote URL"
 grep -q "TARN_ROOT=$ROOT $ROOT/usr/bin/tarnctl status" "$T/live" || fail "live mode: no tarnctl line"
-TARN_ROOT=$ROOT "$ROOT/usr/bin/tarnctl" status | grep -q "^local playing" || fail "live mode: not playing"
+TARN_ROOT=$ROOT "$ROOT/usr/bin/tarnctl" status | grep -q "^\[playing\]" || fail "live mode: not playing"
 /bin/kill -INT -- "-$LIVE"   # Ctrl-C: to the whole foreground group
 wait $LIVE
 rc=$?
@@ -63,7 +63,7 @@ PIDS=$(sed -n 's/^ *kill \([0-9 ]*\) *#.*/\1/p' "$T/keep")
 [ -n "$LINE" ] && [ -n "$PIDS" ] || fail "--netns --keep: no usage lines: $(cat "$T/keep")"
 case "$LINE" in nsenter*) ;; *) fail "--netns --keep: the line does not enter the namespace: $LINE" ;; esac
 out=$(sh -c "$LINE" 2>&1)
-case "$out" in "local playing"*) ok "--netns --keep reachable: $out" ;; *) fail "--netns --keep: $out" ;; esac
+case "$out" in *"[playing]"*) ok "--netns --keep reachable: $out" ;; *) fail "--netns --keep: $out" ;; esac
 DPID=${PIDS%% *}
 [ "$(readlink /proc/$DPID/ns/net)" != "$(readlink /proc/self/ns/net)" ] || fail "--netns: daemon in our namespace"
 kill $PIDS

@@ -80,9 +80,9 @@ int Send(const ControlRequest &request, std::string *reply)
                         path.c_str());
         case EACCES:
         case EPERM:
-            return Fail("not allowed to use %s (permission denied); run tarnctl as a user "
-                        "who may, e.g. root",
-                        path.c_str());
+            return Fail("permission denied: %s belongs to the group set by audio_group in %s; "
+                        "ask to be added to that group (or run tarnctl as root)",
+                        path.c_str(), TarnPath(TARN_INFO_CONF).c_str());
         case ETIMEDOUT:
             return Fail("tarnaudiod did not answer within %d ms (busy or stuck); try again, "
                         "or see the system log",
@@ -254,7 +254,10 @@ const PublishedStatusShm *AttachPublished(bool quiet)
     }
     void *p = shmat(id, nullptr, SHM_RDONLY);
     if (p == reinterpret_cast<void *>(-1)) {
-        if (!quiet)
+        if (!quiet && (errno == EACCES || errno == EPERM))
+            Fail("permission denied: the status segment belongs to the group set by audio_group in %s",
+                 TarnPath(TARN_INFO_CONF).c_str());
+        else if (!quiet)
             Fail("cannot read the published status: %s", strerror(errno));
         return nullptr;
     }
