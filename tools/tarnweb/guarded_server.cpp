@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cerrno>
 #include <climits>
 #include <cstring>
@@ -133,10 +134,67 @@ public:
     socket_t socket() const override { return fd; }
     bool HasBuffered() const { return used < filled; }
 
+    // Reads the head of the next request into the buffer (as far as it
+    // fits) and rewrites a Range end too big for a 64-bit number, such as
+    // "bytes=0-18446744073709551615", as an open end ("bytes=0-"): the
+    // library refuses such a number with 416, where it means "to the end".
+    void NormalizeRangeEnds()
+    {
+        if (used > 0 && used == filled)
+            used = filled = 0;
+        if (used > 0) {  // a request follows another in the buffer
+            memmove(buffer, buffer + used, filled - used);
+            filled -= used;
+            used = 0;
+        }
+        long long end = NowMs() + readTimeoutMs;
+        while (!HeadComplete() && filled < sizeof(buffer)) {
+            long long left = end - NowMs();
+            if (left <= 0 || PollOne(fd, POLLIN, left) <= 0)
+                return;
+            ssize_t n = recv(fd, buffer + filled, sizeof(buffer) - filled, 0);
+            if (n <= 0)
+                return;
+            filled += static_cast<size_t>(n);
+        }
+        if (!HeadComplete())
+            return;
+        std::string head(buffer, filled);
+        size_t headEnd = head.find("\r\n\r\n");
+        std::string lower = head.substr(0, headEnd);
+        for (char &c : lower)
+            c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
+        size_t at = lower.find("\r\nrange:");
+        if (at == std::string::npos)
+            return;
+        size_t lineEnd = lower.find("\r\n", at + 2);
+        // Digit runs after a '-' that no int64 holds are dropped.
+        for (size_t i = at; i < lineEnd; ++i) {
+            if (head[i] != '-')
+                continue;
+            size_t j = i + 1;
+            while (j < lineEnd && isdigit(static_cast<unsigned char>(head[j])))
+                ++j;
+            std::string digits = head.substr(i + 1, j - i - 1);
+            size_t nonZero = digits.find_first_not_of('0');
+            std::string value = nonZero == std::string::npos ? "0" : digits.substr(nonZero);
+            if (value.size() > 19 || (value.size() == 19 && value > "9223372036854775807")) {
+                head.erase(i + 1, j - i - 1);
+                lineEnd -= j - i - 1;
+            }
+        }
+        if (head.size() != filled) {
+            memcpy(buffer, head.data(), head.size());
+            filled = head.size();
+        }
+    }
+
 private:
     int fd;
     long long readTimeoutMs, writeTimeoutMs;
-    char buffer[4096];
+    bool HeadComplete() const { return memmem(buffer + used, filled - used, "\r\n\r\n", 4) != nullptr; }
+
+    char buffer[8192];
     size_t used = 0, filled = 0;
 };
 
@@ -281,6 +339,7 @@ void GuardedServer::ServeReady(int fd, const std::string &client, int requests)
         bool last = svr_sock_ == INVALID_SOCKET || is_running() == false ||
                     static_cast<size_t>(requests) + 1 >= keep_alive_max_count_;
         bool closed = false;
+        strm.NormalizeRangeEnds();
         bool ok = process_request(strm, last, closed, nullptr);
         ++requests;
         if (!ok || closed || last)
