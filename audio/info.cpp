@@ -10,7 +10,6 @@
 #include <sys/ioctl.h>
 #include <unistd.h>
 
-#include "daemon/tarn_types.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"

@@ -4,5 +4,3 @@ volatile sig_atomic_t g_running = 1;
 int g_localSelected = 1;
 int g_selectedRenderer = -1;
 int g_changed = 0;
-int g_sourceType = 0;
-char g_currentPlaylistPath[4096] = "";

@@ -9,7 +9,5 @@ extern volatile sig_atomic_t g_running;  // 1 while the loop turns
 extern int g_localSelected;              // 1: local player selected
 extern int g_selectedRenderer;           // renderer index, -1 for none
 extern int g_changed;                    // published at 4628
-extern int g_sourceType;                 // 0,1,2,3,4,6 (source change)
-extern char g_currentPlaylistPath[4096]; // saved playlist of source type 4
 
 #endif

@@ -10,7 +10,7 @@
 #include <json/json.h>
 
 #include "platform/json_read.h"
-#include "platform/radio_fetch.h"
+#include "source/radio_fetch.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {

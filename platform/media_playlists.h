@@ -15,7 +15,8 @@
 #include <string>
 #include <vector>
 
-#include "daemon/tarn_types.h"
+#include "platform/tarn_media_info.h"
+#include "platform/tarn_env.h"
 
 namespace AudioFile {
 

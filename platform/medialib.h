@@ -16,7 +16,8 @@
 #include <string>
 #include <vector>
 
-#include "daemon/tarn_types.h"
+#include "platform/tarn_media_info.h"
+#include "platform/tarn_env.h"
 
 // TarnPath("/usr/tarn/var/medialib.db") unless MediaLibSetDefaultPath was
 // called (tools pass their --db option there).

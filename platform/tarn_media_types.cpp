@@ -6,7 +6,6 @@
 #include <cstring>
 #include <string>
 
-#include "daemon/tarn_types.h"
 #include "platform/tarn_env.h"
 #include "platform/tlibc_conf.h"
 

@@ -8,7 +8,7 @@
 
 #include <json/json.h>
 
-#include "daemon/tarn_types.h"
+#include "wire/tarn_wire.h"
 
 class Playlist;
 

@@ -9,7 +9,8 @@
 
 #include <malloc.h>
 
-#include "daemon/tarn_types.h"
+#include "platform/tarn_media_info.h"
+#include "wire/tarn_wire.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"

@@ -8,7 +8,8 @@
 
 #include <json/json.h>
 
-#include "daemon/tarn_types.h"
+#include "platform/tarn_media_info.h"
+#include "wire/tarn_wire.h"
 
 // Longest queue unless "audio_queue_max" of the configuration file says
 // otherwise (read once per process); a song beyond it is refused.

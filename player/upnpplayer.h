@@ -8,7 +8,8 @@
 
 #include <json/json.h>
 
-#include "daemon/tarn_types.h"
+#include "platform/tarn_media_info.h"
+#include "wire/tarn_wire.h"
 
 class Playlist;
 class UpnpController;

@@ -6,7 +6,7 @@
 
 #include <time.h>
 
-#include "daemon/tarn_types.h"
+#include "wire/tarn_wire.h"
 
 namespace upnpplayer_internal {
 

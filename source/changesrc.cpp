@@ -15,8 +15,8 @@
 
 #include <json/json.h>
 
-#include "daemon/globals.h"
-#include "daemon/tarn_types.h"
+#include "platform/tarn_media_info.h"
+#include "wire/tarn_wire.h"
 #include "platform/media_playlists.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
@@ -24,6 +24,11 @@
 #include "source/radiolist.h"
 
 static const char kLogUnit[] = "changesrc";
+
+// The source the local queue was last filled from (0,1,2,3,4,6), and the
+// saved playlist of source type 4: the source change's own state.
+static int g_sourceType = 0;
+static char g_currentPlaylistPath[4096] = "";
 
 #define RANDOM_PLAYLIST_FORMAT "/tmp/==DynaRandom100==.%s"
 #define RANDOM_PLAYLIST_OWNER "@remote_control"

@@ -10,9 +10,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "daemon/tarn_types.h"
 #include "platform/json_read.h"
-#include "platform/radio_fetch.h"
+#include "source/radio_fetch.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"

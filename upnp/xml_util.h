@@ -8,7 +8,7 @@
 
 #include "upnp/upnp_sdk.h"
 
-#include "daemon/tarn_types.h"
+#include "platform/tarn_media_info.h"
 
 // Text of an element: the value of its first child when that child is a text
 // node, else "". "" for a missing node.

@@ -14,7 +14,7 @@
 #include <json/json.h>
 
 #include "daemon/tarn_types.h"
-#include "platform/radio_fetch.h"
+#include "source/radio_fetch.h"
 #include "source/radiolist.h"
 #include "tests/harness/harness.h"
 

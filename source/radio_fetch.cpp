@@ -1,6 +1,6 @@
 // Radio directory updaters: the station lists of the RadioIO and SHOUTcast
 // sources come from a radio-browser style directory over HTTP.
-#include "platform/radio_fetch.h"
+#include "source/radio_fetch.h"
 
 #include <cstdio>
 #include <cstdlib>
@@ -8,7 +8,6 @@
 
 #include <curl/curl.h>
 
-#include "daemon/tarn_types.h"
 #include "platform/json_read.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
