@@ -15,6 +15,7 @@ import tempfile
 import time
 import urllib.error
 import urllib.request
+import xml.etree.ElementTree as ET
 
 ACT_PLAY_INDEX = 8
 ACT_GET_STATUS = 19
@@ -40,7 +41,7 @@ def free_port():
 class Stack:
     """Starts the daemon and tarnweb under a fresh root; stop() ends both."""
 
-    def __init__(self, build, song_seconds=30, conf_extra='', songs=True, threads=None):
+    def __init__(self, build, song_seconds=30, conf_extra='', songs=True, threads=None, bind='127.0.0.1'):
         if not in_private_netns():
             raise RuntimeError('run under scripts/netns-run (the daemon sends SSDP)')
         self.build = os.path.abspath(build)
@@ -72,7 +73,7 @@ class Stack:
             self.run(['sh', os.path.join(SRC, 'scripts/make-demo-songs.sh'), self.music, str(song_seconds)])
             self.run([os.path.join(self.bin, 'tarnlib'), 'scan', self.music])
         self.start_daemon()
-        self.start_web(threads)
+        self.start_web(threads, bind)
 
     def conf_path(self):
         return os.path.join(self.root, 'etc/tarninfo.conf')
@@ -90,8 +91,10 @@ class Stack:
             time.sleep(0.1)
         raise RuntimeError('tarnaudiod did not come up: ' + self.log())
 
-    def start_web(self, threads=None):
-        argv = [os.path.join(self.bin, 'tarnweb'), '--bind', '127.0.0.1']
+    def start_web(self, threads=None, bind='127.0.0.1'):
+        # A renderer fetches songs at the daemon's network address: a stack
+        # that plays on one binds every address (of the private namespace).
+        argv = [os.path.join(self.bin, 'tarnweb'), '--bind', bind]
         if threads:
             argv += ['--threads', str(threads)]
         self.web_out = open(os.path.join(self.root, 'tarnweb.out'), 'w')
@@ -198,3 +201,104 @@ class Stack:
         for key in (int(self.env['TARN_SHM_KEY']), int(self.env['TARN_SHM_KEY']) + 1):
             subprocess.run(['ipcrm', '-M', str(key)], stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
         shutil.rmtree(self.root, ignore_errors=True)
+
+
+def listening_address(port):
+    """The IPv4 address a process here listens on at a TCP port, or None:
+    libupnp's HTTP server shows which address a control point took."""
+    with open('/proc/net/tcp') as f:
+        for line in f.readlines()[1:]:
+            local, state = line.split()[1], line.split()[3]
+            addr, lport = local.split(':')
+            if int(lport, 16) == port and state == '0A':
+                return socket.inet_ntoa(struct.pack('=I', int(addr, 16)))
+    return None
+
+
+# The daemon's UPnP stack listens on libupnp's first port.
+DAEMON_UPNP_PORT = 49152
+AVT = 'urn:schemas-upnp-org:service:AVTransport:1'
+
+
+class Renderer:
+    """gmediarender playing into a fakesink, on the veth end (scripts/netns-run)
+    the daemon's UPnP is not on, so that their traffic crosses the pair.
+    stop() ends it."""
+
+    BINARY = '/usr/bin/gmediarender'
+
+    def __init__(self, root, name, udn, port=49494, timeout=30):
+        deadline = time.time() + timeout
+        daemon_ip = None
+        while daemon_ip is None and time.time() < deadline:
+            daemon_ip = listening_address(DAEMON_UPNP_PORT)
+            if daemon_ip is None:
+                time.sleep(0.1)
+        if daemon_ip is None:
+            raise RuntimeError('the daemon\'s UPnP did not listen on port %d within %d s'
+                               % (DAEMON_UPNP_PORT, timeout))
+        first = daemon_ip == '10.77.0.1'
+        self.ip, self.iface = ('10.77.0.2', 'tveth1') if first else ('10.77.0.1', 'tveth0')
+        self.name = name
+        self.port = port
+        self.log_path = os.path.join(root, 'tmp/gmediarender.log')
+        self.out = open(os.path.join(root, 'tmp/gmediarender.out'), 'w')
+        self.proc = subprocess.Popen([self.BINARY, '-I', self.iface, '-p', str(port), '-f', name, '-u', udn,
+                                      '--gstout-audiopipe', 'fakesink sync=true', '--logfile', self.log_path],
+                                     stdout=self.out, stderr=subprocess.STDOUT)
+        self.control = None
+        while time.time() < deadline:
+            if self.proc.poll() is not None:
+                raise RuntimeError('gmediarender ended (%s) at its start: %s' % (self.proc.returncode, self.log()))
+            try:
+                self.control = self.control_url()
+                return
+            except (OSError, ValueError, ET.ParseError):
+                time.sleep(0.1)
+        self.stop()
+        raise RuntimeError('gmediarender did not serve its description on %s:%d within %d s: %s'
+                           % (self.ip, port, timeout, self.log()))
+
+    def control_url(self):
+        base = 'http://%s:%d' % (self.ip, self.port)
+        with urllib.request.urlopen(base + '/description.xml', timeout=5) as r:
+            doc = ET.fromstring(r.read())
+        for svc in doc.iter('{urn:schemas-upnp-org:device-1-0}service'):
+            if svc.findtext('{urn:schemas-upnp-org:device-1-0}serviceType') == AVT:
+                return base + svc.findtext('{urn:schemas-upnp-org:device-1-0}controlURL')
+        raise ValueError('no AVTransport in the description')
+
+    def transport_info(self):
+        """The renderer's own answer to GetTransportInfo: a dict of its
+        CurrentTransportState and CurrentTransportStatus."""
+        body = ('<?xml version="1.0"?><s:Envelope xmlns:s="http://schemas.xmlsoap.org/soap/envelope/" '
+                's:encodingStyle="http://schemas.xmlsoap.org/soap/encoding/"><s:Body>'
+                '<u:GetTransportInfo xmlns:u="%s"><InstanceID>0</InstanceID></u:GetTransportInfo>'
+                '</s:Body></s:Envelope>' % AVT).encode()
+        req = urllib.request.Request(self.control, data=body, method='POST')
+        req.add_header('Content-Type', 'text/xml; charset="utf-8"')
+        req.add_header('SOAPACTION', '"%s#GetTransportInfo"' % AVT)
+        with urllib.request.urlopen(req, timeout=5) as r:
+            doc = ET.fromstring(r.read())
+        out = {}
+        for e in doc.iter():
+            if e.tag in ('CurrentTransportState', 'CurrentTransportStatus'):
+                out[e.tag] = e.text or ''
+        return out
+
+    def log(self):
+        try:
+            with open(self.log_path, errors='replace') as f:
+                return f.read()[-4000:]
+        except OSError:
+            return ''
+
+    def stop(self):
+        if self.proc.poll() is None:
+            self.proc.send_signal(signal.SIGTERM)
+            try:
+                self.proc.wait(10)
+            except subprocess.TimeoutExpired:
+                self.proc.kill()
+                self.proc.wait()
+        self.out.close()

@@ -28,11 +28,16 @@ struct Answer {
     Json::Value json;
 };
 
-// One request. body: JSON text for a POST (nullptr: GET).
-Answer Call(const std::string &path, const char *body = nullptr, std::vector<std::string> headers = {})
+// One request. body: JSON text for a POST (nullptr: GET). With `on`, on
+// that handle, whose connection stays open for the next request when the
+// server keeps it.
+Answer Call(const std::string &path, const char *body = nullptr, std::vector<std::string> headers = {},
+            CURL *on = nullptr)
 {
     Answer a;
-    CURL *c = curl_easy_init();
+    CURL *c = on ? on : curl_easy_init();
+    if (on)
+        curl_easy_setopt(c, CURLOPT_HTTPGET, 1L);
     std::string url = kHost + path;
     curl_easy_setopt(c, CURLOPT_URL, url.c_str());
     curl_easy_setopt(c, CURLOPT_WRITEFUNCTION, Append);
@@ -56,8 +61,10 @@ Answer Call(const std::string &path, const char *body = nullptr, std::vector<std
     curl_easy_setopt(c, CURLOPT_HTTPHEADER, list);
     curl_easy_perform(c);
     curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &a.status);
+    curl_easy_setopt(c, CURLOPT_HTTPHEADER, nullptr);
     curl_slist_free_all(list);
-    curl_easy_cleanup(c);
+    if (!on)
+        curl_easy_cleanup(c);
     Json::CharReaderBuilder rb;
     std::unique_ptr<Json::CharReader> r(rb.newCharReader());
     r->parse(a.body.data(), a.body.data() + a.body.size(), &a.json, nullptr);
@@ -256,6 +263,15 @@ TEST_F(WebApiTest, OnlyChangesFromTheServersOwnPagesByPost)
     EXPECT_EQ(403, Call("/", nullptr, {"Host: rebound.example"}).status);
     EXPECT_EQ(playing, Daemon(ACT_GET_STATUS)["CurrentUri"].asString());
     EXPECT_GE(h.CountLog("Refused cross-site POST /api/player/next"), 3) << h.Log();
+    // A refused request's body is never taken for the next request on the
+    // same connection (as a browser sends it after another site's form).
+    CURL *one = curl_easy_init();
+    EXPECT_EQ(403, Call("/api/player/stop", "x=1", {"Origin: http://evil.example",
+                                                    "Content-Type: application/x-www-form-urlencoded"}, one).status);
+    EXPECT_EQ(200, Call("/", nullptr, {}, one).status);
+    EXPECT_EQ(415, Call("/api/player/stop", "x=1", {"Content-Type: text/plain"}, one).status);
+    EXPECT_EQ(200, Call("/api/status", nullptr, {}, one).status);
+    curl_easy_cleanup(one);
     // The server's own origin, localhost and addresses are fine.
     EXPECT_EQ(200, Call("/api/player/next", "{}", {"Origin: http://127.0.0.1:18080"}).status);
     EXPECT_TRUE(PlayingUri(songs[1].path));

@@ -20,6 +20,9 @@ static const char kLogUnit[] = "tarnweb";
 
 namespace {
 
+// Set by CloseAfterResponse() on the worker that runs the request.
+thread_local bool closeAfterResponse = false;
+
 long long NowMs()
 {
     struct timespec ts;
@@ -294,6 +297,11 @@ void GuardedServer::Close(int fd, const std::string &client)
     Release(client);
 }
 
+void GuardedServer::CloseAfterResponse()
+{
+    closeAfterResponse = true;
+}
+
 bool GuardedServer::process_and_close_socket(socket_t sock)
 {
     int port;
@@ -340,9 +348,10 @@ void GuardedServer::ServeReady(int fd, const std::string &client, int requests)
                     static_cast<size_t>(requests) + 1 >= keep_alive_max_count_;
         bool closed = false;
         strm.NormalizeRangeEnds();
+        closeAfterResponse = false;
         bool ok = process_request(strm, last, closed, nullptr);
         ++requests;
-        if (!ok || closed || last)
+        if (!ok || closed || last || closeAfterResponse)
             break;
         if (!strm.HasBuffered() && PollOne(fd, POLLIN, 0) <= 0) {
             Park(fd, client, requests);

@@ -52,6 +52,12 @@ public:
     long RefusedRoomFull() const { return refusedRoomFull.load(); }
     long ClosedSilent() const { return closedSilent.load(); }
 
+    // For a handler, on the worker serving the request: the connection
+    // closes after this response instead of waiting for another request
+    // (a request refused before its body was read leaves the body in the
+    // stream, where it would be read as the next request).
+    static void CloseAfterResponse();
+
 private:
     struct Waiting {
         int fd;

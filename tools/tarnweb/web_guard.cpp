@@ -18,6 +18,7 @@
 
 #include "platform/tarn_log.h"
 #include "platform/tlibc_conf.h"
+#include "tools/tarnweb/guarded_server.h"
 #include "tools/tarnweb/web_remote.h"
 
 static const char kLogUnit[] = "tarnweb";
@@ -78,8 +79,15 @@ std::string Base64Decode(const std::string &in)
     return out;
 }
 
-void Refuse(httplib::Response &res, int status, const std::string &why)
+// Refused before its body is read: the body stays in the connection, which
+// therefore closes after the answer.
+void Refuse(const httplib::Request &req, httplib::Response &res, int status, const std::string &why)
 {
+    std::string length = req.get_header_value("Content-Length");
+    if ((!length.empty() && length != "0") || req.has_header("Transfer-Encoding")) {
+        res.set_header("Connection", "close");
+        GuardedServer::CloseAfterResponse();
+    }
     Json::Value v;
     v["error"] = why;
     if (status == 401)
@@ -210,7 +218,7 @@ bool WebGuard::Allow(const httplib::Request &req, httplib::Response &res)
     if (!HostAllowed(host)) {
         TLOG("Refused %s %.200s: Host [%.100s] is not this server", req.method.c_str(), req.path.c_str(),
              host.c_str());
-        Refuse(res, 403, "this server does not answer to the name " + host +
+        Refuse(req, res, 403, "this server does not answer to the name " + host +
                              " (add it to web_hosts in the configuration)");
         return false;
     }
@@ -228,7 +236,7 @@ bool WebGuard::Allow(const httplib::Request &req, httplib::Response &res)
     if ((change || api) && !sameOrigin) {
         TLOG("Refused cross-site %s %.200s from origin [%.100s]", req.method.c_str(), req.path.c_str(),
              origin.empty() ? site.c_str() : origin.c_str());
-        Refuse(res, 403, "cross-site request refused");
+        Refuse(req, res, 403, "cross-site request refused");
         return false;
     }
     if (change) {
@@ -238,12 +246,12 @@ bool WebGuard::Allow(const httplib::Request &req, httplib::Response &res)
         std::string length = req.get_header_value("Content-Length");
         bool body = (!length.empty() && length != "0") || req.has_header("Transfer-Encoding");
         if (body && type.compare(0, 16, "application/json") != 0) {
-            Refuse(res, 415, "changes are sent as application/json");
+            Refuse(req, res, 415, "changes are sent as application/json");
             return false;
         }
     }
     if (api && req.path != "/api/login" && req.path != "/api/session" && PasswordSet() && !HasSession(req)) {
-        Refuse(res, 401, "password needed");
+        Refuse(req, res, 401, "password needed");
         return false;
     }
     return true;
