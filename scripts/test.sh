@@ -79,7 +79,7 @@ if [ "$QUICK" = "0" ]; then
             targets=""
             for t in $tests; do targets="$targets ${t#*.}"; done
             if cmake --build build-tsan -j"$JOBS" --target tarnaudiod tarnweb mplayer-daemon $targets; then
-                (cd build-tsan && TSAN_OPTIONS=${TSAN_OPTIONS:-halt_on_error=1} \
+                (cd build-tsan && TSAN_OPTIONS="${TSAN_OPTIONS:-halt_on_error=1} suppressions=$(pwd)/../scripts/tsan.supp" \
                     ctest --output-on-failure -j"$JOBS" -L upnp) || failed="$failed tsan-ctest"
             else
                 failed="$failed tsan-build"

@@ -335,7 +335,13 @@ TEST_F(UpnpDevices, FloodsOfDevicesAndEventsKeepTheDaemonAnswering)
     EXPECT_GT(requests.load(), 20);
     EXPECT_EQ(0, unanswered.load()) << "of " << requests.load() << " requests";
     EXPECT_GT(rssBefore, 0);
-    EXPECT_LT(rssAfter - rssBefore, 32 * 1024) << "KiB";
+    // ThreadSanitizer keeps a shadow of every allocation and its history.
+#ifdef TARN_UNDER_TSAN
+    const long kGrowthKiB = 160 * 1024;
+#else
+    const long kGrowthKiB = 32 * 1024;
+#endif
+    EXPECT_LT(rssAfter - rssBefore, kGrowthKiB) << "KiB";
     EXPECT_EQ(kListMax, listed());
 }
 
