@@ -25,7 +25,6 @@
 #include <sstream>
 #include <string>
 #include <sys/prctl.h>
-#include <sys/shm.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -37,6 +36,7 @@
 
 #include "daemon/ctrl.h"
 #include "daemon/tarn_types.h"
+#include "platform/tarn_shm.h"
 #include "tests/tools/fakedevice/fake_device.h"
 
 #ifndef TARN_BIN_DIR
@@ -248,11 +248,8 @@ struct Ours {
     {
         static PublishedStatusShm *seg = nullptr;
         if (!seg) {
-            int id = shmget(shmKey + 1, sizeof(PublishedStatusShm), 0);
-            if (id < 0)
-                return nullptr;
-            void *p = shmat(id, nullptr, SHM_RDONLY);
-            if (p == reinterpret_cast<void *>(-1))
+            void *p = TarnShmAttach(shmKey + 1, sizeof(PublishedStatusShm), TARN_SHM_READONLY);
+            if (!p)
                 return nullptr;
             seg = static_cast<PublishedStatusShm *>(p);
         }

@@ -18,6 +18,7 @@
 
 #include "daemon/ctrl.h"
 #include "platform/tarn_env.h"
+#include "platform/tarn_shm.h"
 #include "platform/tlibc_proc.h"
 
 namespace tarntest {
@@ -72,11 +73,7 @@ void RemoveSegment(int key) { shmctl(shmget(key, 0, 0), IPC_RMID, nullptr); }
 
 void *AttachSegment(int key, size_t size, bool readOnly)
 {
-    int id = shmget(key, size, 0);
-    if (id < 0)
-        return nullptr;
-    void *p = shmat(id, nullptr, readOnly ? SHM_RDONLY : 0);
-    return p == reinterpret_cast<void *>(-1) ? nullptr : p;
+    return TarnShmAttach(key, size, readOnly ? TARN_SHM_READONLY : 0);
 }
 
 }  // namespace
