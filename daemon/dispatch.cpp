@@ -62,28 +62,6 @@ int ReadRequest(int fd, GuardedRequest *in)
     return 0;
 }
 
-int ChangeSource(int action, const char *parameter, LocalPlayer *player)
-{
-    switch (action) {
-    case ACT_SOURCE_RANDOM:
-        return ChangeSourceRandom100(player, true);
-    case ACT_SOURCE_RADIO:
-        return ChangeSourceRadio(player);
-    case ACT_SOURCE_IPOD:
-        return ChangeSourceIPod(player);
-    case ACT_SOURCE_PLAYLIST:
-        return ChangeSourceFirstPlaylist(player);
-    case ACT_SOURCE_CUSTOM:
-        return ChangeSourceCustom(static_cast<int>(strtol(parameter, nullptr, 10)), player);
-    case ACT_SOURCE_NEXT:
-        return ChangeSourceNext(player);
-    case ACT_SOURCE_PREVIOUS:
-        return ChangeSourcePrevious(player);
-    default:
-        return -1;
-    }
-}
-
 UpnpPlayer *FindPlayerByUdn(std::vector<UpnpPlayer *> &players, const std::string &udn)
 {
     for (UpnpPlayer *p : players) {
@@ -192,60 +170,123 @@ void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE])
     snprintf(buffer, CTRL_REPLY_SIZE, "%s", text.c_str());
 }
 
+namespace {
+
+// What a daemon-level handler gets.
+struct DispatchCall {
+    const ControlRequest *request;
+    Json::Value &reply;
+    LocalPlayer *localPlayer;
+    UpnpController *controller;
+    std::vector<UpnpPlayer *> &upnpPlayers;
+};
+
+// A source change: 0 when the local queue was replaced.
+typedef int (*SourceChange)(const char *parameter, LocalPlayer *player);
+// Any other action the daemon itself takes.
+typedef void (*DaemonHandler)(DispatchCall &call);
+
+// One action code the daemon answers itself: either a source change or a
+// handler.
+struct DaemonAction {
+    int action;
+    SourceChange change;
+    DaemonHandler handle;
+};
+
+int SourceRandom(const char *, LocalPlayer *player) { return ChangeSourceRandom100(player, true); }
+int SourceRadio(const char *, LocalPlayer *player) { return ChangeSourceRadio(player); }
+int SourceIPod(const char *, LocalPlayer *player) { return ChangeSourceIPod(player); }
+int SourcePlaylist(const char *, LocalPlayer *player) { return ChangeSourceFirstPlaylist(player); }
+int SourceNext(const char *, LocalPlayer *player) { return ChangeSourceNext(player); }
+int SourcePrevious(const char *, LocalPlayer *player) { return ChangeSourcePrevious(player); }
+int SourceCustom(const char *parameter, LocalPlayer *player)
+{
+    return ChangeSourceCustom(static_cast<int>(strtol(parameter, nullptr, 10)), player);
+}
+
+void SearchServers(DispatchCall &call) { call.controller->SearchServers(); }
+
+void SearchRenderers(DispatchCall &call)
+{
+    call.controller->SearchQuick();
+    call.controller->SearchRenderers();
+}
+
+void ListDevices(DispatchCall &call)
+{
+    int start = 0;
+    int limit = 0;
+    if (sscanf(call.request->parameter, "%d %d", &start, &limit) < 1)
+        start = 0;
+    call.controller->Lock();
+    if (call.request->action == ACT_LIST_SERVERS)
+        call.controller->GetServerList(call.reply, start, limit);
+    else
+        call.controller->GetRendererList(call.reply, start, limit);
+    call.controller->Unlock();
+}
+
+void SelectPlayerAction(DispatchCall &call)
+{
+    SelectPlayer(call.request->parameter, call.controller, call.upnpPlayers);
+}
+
+void ClearChanged(DispatchCall &) { g_changed = 0; }
+void SetChanged(DispatchCall &) { g_changed = 1; }
+
+void SaveCustom(DispatchCall &call)
+{
+    SaveCustomSource(static_cast<int>(strtol(call.request->parameter, nullptr, 10)),
+                     call.localPlayer);
+}
+
+const DaemonAction kDaemonActions[] = {
+    {ACT_SOURCE_RANDOM, SourceRandom, nullptr},
+    {ACT_SOURCE_RADIO, SourceRadio, nullptr},
+    {ACT_SOURCE_IPOD, SourceIPod, nullptr},
+    {ACT_SOURCE_PLAYLIST, SourcePlaylist, nullptr},
+    {ACT_SOURCE_CUSTOM, SourceCustom, nullptr},
+    {ACT_SOURCE_NEXT, SourceNext, nullptr},
+    {ACT_SOURCE_PREVIOUS, SourcePrevious, nullptr},
+    {ACT_SEARCH_SERVERS, nullptr, SearchServers},
+    {ACT_SEARCH_RENDERERS, nullptr, SearchRenderers},
+    {ACT_LIST_SERVERS, nullptr, ListDevices},
+    {ACT_LIST_RENDERERS, nullptr, ListDevices},
+    {ACT_SELECT_PLAYER, nullptr, SelectPlayerAction},
+    {ACT_CLEAR_CHANGED, nullptr, ClearChanged},
+    {ACT_SET_CHANGED, nullptr, SetChanged},
+    {ACT_SAVE_CUSTOM, nullptr, SaveCustom},
+};
+
+const DaemonAction *FindDaemonAction(int action)
+{
+    for (const DaemonAction &d : kDaemonActions) {
+        if (d.action == action)
+            return &d;
+    }
+    return nullptr;
+}
+
+}  // namespace
+
 void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
                      UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers)
 {
-    const char *parameter = request->parameter;
-    switch (request->action) {
-    case ACT_SOURCE_RANDOM:
-    case ACT_SOURCE_RADIO:
-    case ACT_SOURCE_IPOD:
-    case ACT_SOURCE_PLAYLIST:
-    case ACT_SOURCE_CUSTOM:
-    case ACT_SOURCE_NEXT:
-    case ACT_SOURCE_PREVIOUS:
+    const DaemonAction *own = FindDaemonAction(request->action);
+    if (own && own->change) {
         // A source change always returns playback to the local player,
         // before the change is even attempted.
         g_localSelected = 1;
         g_selectedRenderer = -1;
-        if (ChangeSource(request->action, parameter, localPlayer) == 0)
+        if (own->change(request->parameter, localPlayer) == 0)
             g_changed = 1;
         return;
-    case ACT_SEARCH_SERVERS:
-        controller->SearchServers();
-        return;
-    case ACT_SEARCH_RENDERERS:
-        controller->SearchQuick();
-        controller->SearchRenderers();
-        return;
-    case ACT_LIST_SERVERS:
-    case ACT_LIST_RENDERERS: {
-        int start = 0;
-        int limit = 0;
-        if (sscanf(parameter, "%d %d", &start, &limit) < 1)
-            start = 0;
-        controller->Lock();
-        if (request->action == ACT_LIST_SERVERS)
-            controller->GetServerList(reply, start, limit);
-        else
-            controller->GetRendererList(reply, start, limit);
-        controller->Unlock();
-        return;
     }
-    case ACT_SELECT_PLAYER:
-        SelectPlayer(parameter, controller, upnpPlayers);
+    if (own) {
+        DispatchCall call = {request, reply, localPlayer, controller, upnpPlayers};
+        own->handle(call);
         return;
-    case ACT_CLEAR_CHANGED:
-        g_changed = 0;
-        return;
-    case ACT_SET_CHANGED:
-        g_changed = 1;
-        return;
-    case ACT_SAVE_CUSTOM:
-        SaveCustomSource(static_cast<int>(strtol(parameter, nullptr, 10)), localPlayer);
-        return;
-    default:
-        break;
     }
     // Everything else goes to the selected player.
     if (g_localSelected) {
