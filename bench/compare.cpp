@@ -25,7 +25,6 @@
 #include <sstream>
 #include <string>
 #include <sys/prctl.h>
-#include <sys/shm.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -35,7 +34,9 @@
 #include <vector>
 #include <dirent.h>
 
+#include "daemon/ctrl.h"
 #include "daemon/tarn_types.h"
+#include "platform/tarn_shm.h"
 #include "tests/tools/fakedevice/fake_device.h"
 
 #ifndef TARN_BIN_DIR
@@ -160,7 +161,7 @@ double Percentile(std::vector<double> v, double p)
 }
 
 // ---------------------------------------------------------------------------
-// Raw Unix socket client.
+// Raw Unix socket client (for the other daemon).
 int ConnectUnix(const std::string &path)
 {
     int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
@@ -209,7 +210,7 @@ struct Ours {
         req.action = action;
         if (param && len)
             memcpy(req.parameter, param, std::min(len, sizeof(req.parameter)));
-        int fd = ConnectUnix(sock);
+        int fd = CtrlConnectAt(sock.c_str(), false, nullptr);
         if (fd < 0)
             return false;
         // One write: the daemon refuses a request that arrives in pieces.
@@ -217,21 +218,13 @@ struct Ours {
             close(fd);
             return false;
         }
-        static thread_local char buf[CTRL_REPLY_SIZE];
-        size_t got = 0;
-        while (got < sizeof(buf)) {
-            ssize_t r = read(fd, buf + got, sizeof(buf) - got);
-            if (r < 0 && errno == EINTR)
-                continue;
-            if (r <= 0)
-                break;
-            got += static_cast<size_t>(r);
-        }
+        std::string data;
+        CtrlReadUntilClosed(fd, 5000, &data);
         close(fd);
-        if (got == 0)
+        if (data.empty())
             return false;
         if (reply)
-            reply->assign(buf, strnlen(buf, got));
+            reply->assign(data.c_str(), strnlen(data.c_str(), data.size()));
         return true;
     }
     bool Text(int action, const std::string &text, std::string *reply = nullptr)
@@ -255,11 +248,8 @@ struct Ours {
     {
         static PublishedStatusShm *seg = nullptr;
         if (!seg) {
-            int id = shmget(shmKey + 1, sizeof(PublishedStatusShm), 0);
-            if (id < 0)
-                return nullptr;
-            void *p = shmat(id, nullptr, SHM_RDONLY);
-            if (p == reinterpret_cast<void *>(-1))
+            void *p = TarnShmAttach(shmKey + 1, sizeof(PublishedStatusShm), TARN_SHM_READONLY);
+            if (!p)
                 return nullptr;
             seg = static_cast<PublishedStatusShm *>(p);
         }
@@ -704,7 +694,7 @@ void SilentClients(Ours &o, Mpd &m, int repeats)
         Progress("silent clients, run %d/%d (3 silent, %d requests each side)", r + 1, repeats, n);
         std::vector<int> silent;
         for (int i = 0; i < 3; ++i) {
-            silent.push_back(ConnectUnix(o.sock));
+            silent.push_back(CtrlConnectAt(o.sock.c_str(), false, nullptr));
             silent.push_back(ConnectUnix(m.sock));
         }
         std::vector<double> to, tm;

@@ -33,10 +33,6 @@
 // median and 99th percentile, descriptors and RSS before and after.
 // Exit status 0 when every check held, 1 otherwise.
 #include <errno.h>
-#include <fcntl.h>
-#include <poll.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -59,6 +55,7 @@
 
 #include <json/json.h>
 
+#include "daemon/ctrl.h"
 #include "daemon/tarn_types.h"
 #include "tests/harness/harness.h"
 
@@ -83,45 +80,14 @@ enum ConnResult { CONN_OK, CONN_REFUSED, CONN_ERROR };
 // retried by the caller) instead of a blocked thread.
 ConnResult ConnectOnce(int *out)
 {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+    int err = 0;
+    int fd = CtrlConnectAt(g_socketPath.c_str(), true, &err);
+    if (fd == -2)
+        return (err == EAGAIN || err == ECONNREFUSED) ? CONN_REFUSED : CONN_ERROR;
     if (fd < 0)
         return CONN_ERROR;
-    struct sockaddr_un addr;
-    memset(&addr, 0, sizeof(addr));
-    addr.sun_family = AF_UNIX;
-    snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", g_socketPath.c_str());
-    if (connect(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) != 0) {
-        int err = errno;
-        close(fd);
-        return (err == EAGAIN || err == ECONNREFUSED) ? CONN_REFUSED : CONN_ERROR;
-    }
-    int flags = fcntl(fd, F_GETFL);
-    fcntl(fd, F_SETFL, flags & ~O_NONBLOCK);
     *out = fd;
     return CONN_OK;
-}
-
-// Reads until the peer closes or timeoutMs passes; returns the byte count.
-size_t ReadAll(int fd, std::string *data, int timeoutMs)
-{
-    long end = NowMs() + timeoutMs;
-    for (;;) {
-        long left = end - NowMs();
-        if (left <= 0)
-            break;
-        struct pollfd p = {fd, POLLIN, 0};
-        int r = poll(&p, 1, static_cast<int>(left));
-        if (r < 0 && errno == EINTR)
-            continue;
-        if (r <= 0)
-            break;
-        char buf[8192];
-        ssize_t n = read(fd, buf, sizeof(buf));
-        if (n <= 0)
-            break;
-        data->append(buf, static_cast<size_t>(n));
-    }
-    return data->size();
 }
 
 // ---- statistics ---------------------------------------------------------------
@@ -183,7 +149,7 @@ int ValidRequest(const ControlRequest &req, std::string *reply, long deadlineMs)
     // Generous: hostile clients hold the daemon up to 0.5 s each, and a
     // client may wait behind several of them.
     std::string data;
-    ReadAll(fd, &data, 60000);
+    CtrlReadUntilClosed(fd, 60000, &data);
     close(fd);
     long ms = NowMs() - t0;
     if (data.size() != CTRL_REPLY_SIZE || data.find('\0') == std::string::npos) {
@@ -228,7 +194,7 @@ void Hostile(int kind, std::mt19937 &rng)
         if (write(fd, &req, sizeof(req)) < 0) {
         }
         std::string data;
-        ReadAll(fd, &data, 3000);
+        CtrlReadUntilClosed(fd, 3000, &data);
         break;
     }
     }

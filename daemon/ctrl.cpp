@@ -1,9 +1,12 @@
 #include "daemon/ctrl.h"
 
 #include <cerrno>
+#include <chrono>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <fcntl.h>
+#include <poll.h>
 #include <string>
 #include <sys/select.h>
 #include <sys/socket.h>
@@ -63,30 +66,66 @@ int CtrlConnect()
     return CtrlConnectWhy(nullptr);
 }
 
-int CtrlConnectWhy(int *error)
+int CtrlConnectAt(const char *path, bool nonBlocking, int *error)
 {
     if (error)
         *error = 0;
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | (nonBlocking ? SOCK_NONBLOCK : 0), 0);
     if (fd < 0) {
         if (error)
             *error = errno;
-        return fd;
+        return -1;
     }
-    std::string path = TarnPath(TARN_CTRL_SOCKET);
     struct sockaddr_un addr;
     memset(&addr, 0, sizeof(addr));
     addr.sun_family = AF_UNIX;
-    snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", path.c_str());
+    snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", path);
     if (connect(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) == -1) {
         int err = errno;
-        TarnLog("%s:%d Failed to connect to %s. [%m]", kCtrlUnit, 27, path.c_str());
         close(fd);
+        errno = err;
         if (error)
             *error = err;
+        return -2;
+    }
+    if (nonBlocking)
+        fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) & ~O_NONBLOCK);
+    return fd;
+}
+
+int CtrlConnectWhy(int *error)
+{
+    std::string path = TarnPath(TARN_CTRL_SOCKET);
+    int fd = CtrlConnectAt(path.c_str(), false, error);
+    if (fd == -2) {
+        TarnLog("%s:%d Failed to connect to %s. [%m]", kCtrlUnit, 27, path.c_str());
         return -1;
     }
     return fd;
+}
+
+size_t CtrlReadUntilClosed(int fd, int timeoutMs, std::string *data)
+{
+    using Clock = std::chrono::steady_clock;
+    Clock::time_point end = Clock::now() + std::chrono::milliseconds(timeoutMs);
+    for (;;) {
+        long long left =
+            std::chrono::duration_cast<std::chrono::milliseconds>(end - Clock::now()).count();
+        if (left <= 0)
+            break;
+        struct pollfd p = {fd, POLLIN, 0};
+        int r = poll(&p, 1, static_cast<int>(left));
+        if (r < 0 && errno == EINTR)
+            continue;
+        if (r <= 0)
+            break;
+        char buf[8192];
+        ssize_t n = read(fd, buf, sizeof(buf));
+        if (n <= 0)
+            break;
+        data->append(buf, static_cast<size_t>(n));
+    }
+    return data->size();
 }
 
 int CtrlSendRequest(const ControlRequest *request, char *reply, int replySize)

@@ -5,10 +5,24 @@
 #ifndef TARN_CTRL_H
 #define TARN_CTRL_H
 
+#include <string>
+
 #include "daemon/tarn_types.h"
 
 // A descriptor connected to the control socket, or a negative value.
 int CtrlConnect();
+
+// A descriptor connected to the control socket at path (a daemon under
+// another root), or a negative value with *error (when given) set to the
+// errno of the failed step: -1 no socket could be made, -2 the connect
+// failed. Logs nothing: the caller tells. With nonBlocking a full backlog
+// fails at once with EAGAIN instead of waiting; the descriptor returned is
+// blocking either way.
+int CtrlConnectAt(const char *path, bool nonBlocking, int *error);
+
+// Appends what comes on fd to *data until the peer closes it, an error, or
+// timeoutMs pass (interrupted waits go on); returns the size of *data.
+size_t CtrlReadUntilClosed(int fd, int timeoutMs, std::string *data);
 
 // Sends the 8196-byte request in one write and reads the first chunk of the
 // reply (waiting at most 0.5 s) into reply[0..replySize). 0 or -1.

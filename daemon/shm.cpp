@@ -4,23 +4,20 @@
 #include <sys/shm.h>
 
 #include "platform/tarn_log.h"
+#include "platform/tarn_shm.h"
 
 static const char kLogUnit[] = "shm";
 
 void *ShmCreateAttach(int key, int size, int create)
 {
-    int flags = create ? (IPC_CREAT | 0666) : 0666;
-    int id = shmget(key, static_cast<size_t>(size), flags);
-    if (id < 0) {
+    TarnShmStep failed = TARN_SHM_STEP_NONE;
+    void *address =
+        TarnShmAttach(key, static_cast<size_t>(size), create ? TARN_SHM_CREATE : 0, &failed);
+    if (failed == TARN_SHM_STEP_GET)
         TarnLog("%s:%d Failed to create shared memory. key[%d], size[%d], [%m]", kLogUnit, 35,
                 key, size);
-        return nullptr;
-    }
-    void *address = shmat(id, nullptr, 0);
-    if (address == reinterpret_cast<void *>(-1)) {
+    else if (failed == TARN_SHM_STEP_ATTACH)
         TarnLog("%s:%d Failed to attach shared memory. [%m]", kLogUnit, 41);
-        return nullptr;
-    }
     return address;
 }
 

@@ -1,5 +1,5 @@
-// The tarnaudiod process: start-up, the polling loop, the control request
-// handler and the ordered shutdown.
+// The tarnaudiod process: start-up, the polling loop and the ordered
+// shutdown (tarnaudiod.cpp), the control request handler (dispatch.cpp).
 #ifndef TARN_TARNAUDIOD_H
 #define TARN_TARNAUDIOD_H
 
@@ -74,6 +74,14 @@ int HandleRequest(int fd, LocalPlayer *localPlayer, UpnpController *controller,
 // source changes and the selected player. The reply value is filled in.
 void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
                      UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers);
+
+// Serves the ready connection fd of ctx.conns: one read of the request (a
+// short one closes the connection), dispatch, and the reply handed to
+// ctx.conns to write.
+void ServeRequest(DaemonContext &ctx, int fd);
+
+// The renderer player whose renderer has the index, or nullptr.
+UpnpPlayer *FindPlayerByIndex(std::vector<UpnpPlayer *> &players, int index);
 
 // The reply text as sent: the styled JSON text cut to 8191 characters and
 // NUL-terminated in an 8192-byte buffer.

@@ -9,17 +9,16 @@
 #include <filesystem>
 #include <fstream>
 #include <fcntl.h>
-#include <poll.h>
 #include <spawn.h>
 #include <sys/ipc.h>
 #include <sys/prctl.h>
 #include <sys/shm.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "daemon/ctrl.h"
 #include "platform/tarn_env.h"
+#include "platform/tarn_shm.h"
 #include "platform/tlibc_proc.h"
 
 namespace tarntest {
@@ -74,29 +73,7 @@ void RemoveSegment(int key) { shmctl(shmget(key, 0, 0), IPC_RMID, nullptr); }
 
 void *AttachSegment(int key, size_t size, bool readOnly)
 {
-    int id = shmget(key, size, 0);
-    if (id < 0)
-        return nullptr;
-    void *p = shmat(id, nullptr, readOnly ? SHM_RDONLY : 0);
-    return p == reinterpret_cast<void *>(-1) ? nullptr : p;
-}
-
-// What comes on fd until it is closed or the deadline passes.
-std::string ReadUntilClosed(int fd, long end)
-{
-    std::string data;
-    for (long left; (left = end - NowMs()) > 0;) {
-        struct pollfd p = {fd, POLLIN, 0};
-        int r = poll(&p, 1, static_cast<int>(left));
-        if (r < 0 && errno == EINTR)
-            continue;
-        char buf[8192];
-        ssize_t n = r > 0 ? read(fd, buf, sizeof(buf)) : 0;
-        if (n <= 0)
-            break;
-        data.append(buf, static_cast<size_t>(n));
-    }
-    return data;
+    return TarnShmAttach(key, size, readOnly ? TARN_SHM_READONLY : 0);
 }
 
 }  // namespace
@@ -329,7 +306,8 @@ int Harness::Run(const std::vector<std::string> &argv, std::string *out, int tim
     }
     long end = NowMs() + timeoutMs;
     // Until every holder of the pipe closed it (a daemonizing child lets go).
-    std::string text = ReadUntilClosed(fds[0], end);
+    std::string text;
+    CtrlReadUntilClosed(fds[0], timeoutMs, &text);
     close(fds[0]);
     if (out)
         *out = text;
@@ -399,17 +377,8 @@ int Harness::Stop(int timeoutMs)
 
 int Harness::Connect() const
 {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0)
-        return -1;
-    struct sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
-    snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", Path(TARN_CTRL_SOCKET).c_str());
-    if (connect(fd, reinterpret_cast<struct sockaddr *>(&addr), sizeof(addr)) != 0) {
-        close(fd);
-        return -1;
-    }
-    return fd;
+    int fd = CtrlConnectAt(Path(TARN_CTRL_SOCKET).c_str(), false, nullptr);
+    return fd < 0 ? -1 : fd;
 }
 
 int Harness::SendBytes(const void *bytes, size_t length, std::string *reply, int timeoutMs,
@@ -429,7 +398,8 @@ int Harness::SendBytes(const void *bytes, size_t length, std::string *reply, int
         close(fd);
         return -1;
     }
-    std::string data = ReadUntilClosed(fd, NowMs() + timeoutMs);
+    std::string data;
+    CtrlReadUntilClosed(fd, timeoutMs, &data);
     close(fd);
     if (received)
         *received = data.size();

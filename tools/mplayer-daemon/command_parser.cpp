@@ -196,36 +196,65 @@ MplayerCommandParser::Result MplayerCommandParser::ParseAt(size_t at, bool flush
 MplayerCommandParser::Result MplayerCommandParser::ParseLoadfile(size_t at, bool flush,
                                                                  size_t *used, MplayerCommand *cmd)
 {
-    const size_t size = buf_.size();
     size_t i = at + 8;
-    while (i < size && (buf_[i] == ' ' || buf_[i] == '\t'))
+    while (i < buf_.size() && (buf_[i] == ' ' || buf_[i] == '\t'))
         ++i;
-    if (i >= size)
+    if (i >= buf_.size())
         return NEED_MORE;
+    if (buf_[i] != '"')
+        return ParseBareUri(at, i, flush, used, cmd);
+    return ParseQuotedUri(at, i + 1, flush, used, cmd);
+}
 
-    std::string uri;
-    if (buf_[i] != '"') {
-        // Lenient form without quotes (typed by hand): up to the line end.
-        size_t start = i;
-        while (i < size && !IsLineEnd(buf_[i])) {
-            if (i - start >= kMaxUriBytes)
-                return BAD;
-            ++i;
-        }
-        if (i >= size && !flush)
-            return NEED_MORE;
-        uri = buf_.substr(start, i - start);
-        while (!uri.empty() && (uri.back() == ' ' || uri.back() == '\t'))
-            uri.pop_back();
-        if (uri.empty())
+MplayerCommandParser::Result MplayerCommandParser::ParseBareUri(size_t at, size_t start,
+                                                                bool flush, size_t *used,
+                                                                MplayerCommand *cmd)
+{
+    // Lenient form without quotes (typed by hand): up to the line end.
+    const size_t size = buf_.size();
+    size_t i = start;
+    while (i < size && !IsLineEnd(buf_[i])) {
+        if (i - start >= kMaxUriBytes)
             return BAD;
-        cmd->uri = uri;
-        *used = i - at;
-        return DONE;
+        ++i;
     }
+    if (i >= size && !flush)
+        return NEED_MORE;
+    std::string uri = buf_.substr(start, i - start);
+    while (!uri.empty() && (uri.back() == ' ' || uri.back() == '\t'))
+        uri.pop_back();
+    if (uri.empty())
+        return BAD;
+    cmd->uri = uri;
+    *used = i - at;
+    return DONE;
+}
 
-    ++i;
-    const size_t start = i;
+int MplayerCommandParser::QuoteClosesAt(size_t i, bool flush) const
+{
+    const size_t size = buf_.size();
+    size_t j = i + 1;
+    while (j < size && (buf_[j] == ' ' || buf_[j] == '\t'))
+        ++j;
+    if (j >= size)
+        return flush ? 1 : -1;
+    int type = 0;
+    size_t len = 0;
+    int w = IsLineEnd(buf_[j]) ? 1 : WordAt(j, &type, &len);
+    if (w == 1 || (w == 0 && flush))
+        return 1;
+    if (w == 0)
+        return -1;
+    return 0;
+}
+
+MplayerCommandParser::Result MplayerCommandParser::ParseQuotedUri(size_t at, size_t start,
+                                                                  bool flush, size_t *used,
+                                                                  MplayerCommand *cmd)
+{
+    const size_t size = buf_.size();
+    size_t i = start;
+    std::string uri;
     // Where the URI would end if the last quote seen were the closing one:
     // used when the URI runs into a line end, the end of the data or the
     // length limit without a clear closing quote (garbage after the quote).
@@ -269,26 +298,14 @@ MplayerCommandParser::Result MplayerCommandParser::ParseLoadfile(size_t at, bool
         }
         if (c == '"') {
             // The closing quote, unless the URI goes on after it.
-            size_t j = i + 1;
-            while (j < size && (buf_[j] == ' ' || buf_[j] == '\t'))
-                ++j;
-            if (j >= size) {
-                if (!flush)
-                    return NEED_MORE;
-                ++i;
-                ended = true;
-                break;
-            }
-            int type = 0;
-            size_t len = 0;
-            int w = IsLineEnd(buf_[j]) ? 1 : WordAt(j, &type, &len);
-            if (w == 1 || (w == 0 && flush)) {
-                ++i;
-                ended = true;
-                break;
-            }
-            if (w == 0)
+            int closes = QuoteClosesAt(i, flush);
+            if (closes < 0)
                 return NEED_MORE;
+            if (closes > 0) {
+                ++i;
+                ended = true;
+                break;
+            }
             sawQuote = true;
             lastQuote = i;
             uriAtLastQuote = uri.size();

@@ -69,6 +69,15 @@ private:
     void Run(bool flush, std::vector<MplayerCommand> *out);
     Result ParseAt(size_t at, bool flush, size_t *used, MplayerCommand *cmd);
     Result ParseLoadfile(size_t at, bool flush, size_t *used, MplayerCommand *cmd);
+    // The URI of the loadfile at 'at' without quotes, from 'start' to the
+    // line end.
+    Result ParseBareUri(size_t at, size_t start, bool flush, size_t *used, MplayerCommand *cmd);
+    // The URI of the loadfile at 'at' whose opening quote is just before
+    // 'start'.
+    Result ParseQuotedUri(size_t at, size_t start, bool flush, size_t *used, MplayerCommand *cmd);
+    // At a double quote at i: 1 it closes the URI, 0 it belongs to the URI,
+    // -1 more bytes are needed to tell.
+    int QuoteClosesAt(size_t i, bool flush) const;
     Result ParseArgs(size_t at, const char *allowed, size_t *end);
     // 1 a whole command word starts at 'at', 0 the rest of the buffer is a
     // proper prefix of one, -1 neither.

@@ -1,6 +1,7 @@
 #include "tools/mplayer-daemon/status_segment.h"
 
 #include "platform/tarn_log.h"
+#include "platform/tarn_shm.h"
 
 #include <cstring>
 #include <sys/ipc.h>
@@ -34,14 +35,14 @@ StatusSegment::~StatusSegment()
 int StatusSegment::Attach(int key)
 {
     Detach();
-    int id = shmget(key, sizeof(PlayerStatusShm), IPC_CREAT | 0666);
-    if (id < 0) {
+    TarnShmStep failed = TARN_SHM_STEP_NONE;
+    void *p = TarnShmAttach(key, sizeof(PlayerStatusShm), TARN_SHM_CREATE, &failed);
+    if (failed == TARN_SHM_STEP_GET) {
         TLOG("Failed to get the player status segment. key[%d], size[%d], [%m]", key,
              static_cast<int>(sizeof(PlayerStatusShm)));
         return -1;
     }
-    void *p = shmat(id, nullptr, 0);
-    if (p == reinterpret_cast<void *>(-1)) {
+    if (!p) {
         TLOG("Failed to attach the player status segment. [%m]");
         return -1;
     }

@@ -1,7 +1,5 @@
 #include "tools/tarnctl/client.h"
 
-#include <sys/ipc.h>
-#include <sys/shm.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -16,6 +14,7 @@
 
 #include "daemon/ctrl.h"
 #include "platform/tarn_env.h"
+#include "platform/tarn_shm.h"
 
 bool g_json = false;
 int g_timeoutMs = 3000;
@@ -245,15 +244,16 @@ std::string ClockText(int seconds)
 
 const PublishedStatusShm *AttachPublished(bool quiet)
 {
-    int id = shmget(TarnShmKeyPublished(), TARN_SHM_PUBLISHED_SIZE, 0);
-    if (id < 0) {
+    TarnShmStep failed = TARN_SHM_STEP_NONE;
+    void *p = TarnShmAttach(TarnShmKeyPublished(), TARN_SHM_PUBLISHED_SIZE, TARN_SHM_READONLY,
+                            &failed);
+    if (failed == TARN_SHM_STEP_GET) {
         if (!quiet)
             Fail("no published status (segment key %d: %s); is tarnaudiod running?",
                  TarnShmKeyPublished(), strerror(errno));
         return nullptr;
     }
-    void *p = shmat(id, nullptr, SHM_RDONLY);
-    if (p == reinterpret_cast<void *>(-1)) {
+    if (!p) {
         if (!quiet && (errno == EACCES || errno == EPERM))
             Fail("permission denied: the status segment belongs to the group set by audio_group in %s",
                  TarnPath(TARN_INFO_CONF).c_str());

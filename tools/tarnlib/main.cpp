@@ -205,6 +205,88 @@ static int CmdPlaylistShow(const char *path)
     return 0;
 }
 
+// smart list: every smart playlist with its match mode and rules.
+static int SmartList(MediaLib &lib)
+{
+    std::vector<SmartPlaylist> lists;
+    if (lib.ListSmart(&lists) != 0) {
+        fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
+        return 1;
+    }
+    for (const SmartPlaylist &p : lists) {
+        printf("%s\t%s", p.name.c_str(), p.matchAny ? "any" : "all");
+        for (const SmartRule &r : p.rules)
+            printf("\t%s", SmartRuleText(r).c_str());
+        printf("\n");
+    }
+    return 0;
+}
+
+// smart show NAME: the songs the playlist matches.
+static int SmartShow(MediaLib &lib, const char *name)
+{
+    SmartPlaylist p;
+    int rc = lib.FindSmart(name, &p);
+    if (rc != 1) {
+        fprintf(stderr, "tarnlib: %s\n",
+                rc == 0 ? (std::string("no smart playlist named \"") + name + "\"").c_str()
+                        : lib.LastError().c_str());
+        return 1;
+    }
+    std::vector<MediaSong> songs;
+    int total = 0;
+    if (lib.SmartSongs(p, &songs, 0, 0, &total) != 0) {
+        fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
+        return 1;
+    }
+    printf("# %s: %d songs\n", p.name.c_str(), total);
+    for (const MediaSong &s : songs)
+        PrintSong(s);
+    return 0;
+}
+
+// smart create NAME [--any] RULE...: argv[0] is "create".
+static int SmartCreate(MediaLib &lib, int argc, char **argv)
+{
+    SmartPlaylist p;
+    p.name = argv[1];
+    for (int i = 2; i < argc; i++) {
+        if (strcmp(argv[i], "--any") == 0) {
+            p.matchAny = true;
+            continue;
+        }
+        SmartRule r;
+        std::string why;
+        if (SmartRuleParse(argv[i], &r, &why) != 0) {
+            fprintf(stderr, "tarnlib: bad rule \"%s\": %s\n", argv[i], why.c_str());
+            return 2;
+        }
+        p.rules.push_back(r);
+    }
+    if (lib.SaveSmart(p) != 0) {
+        fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
+        return 1;
+    }
+    printf("Smart playlist \"%s\" saved with %zu rules\n", p.name.c_str(), p.rules.size());
+    return 0;
+}
+
+// smart delete NAME.
+static int SmartDelete(MediaLib &lib, const char *name)
+{
+    int rc = lib.DeleteSmart(name);
+    if (rc < 0) {
+        fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
+        return 1;
+    }
+    if (rc == 0) {
+        fprintf(stderr, "tarnlib: no smart playlist named \"%s\"\n", name);
+        return 1;
+    }
+    printf("Smart playlist \"%s\" deleted\n", name);
+    return 0;
+}
+
 static int CmdSmart(int argc, char **argv)
 {
     if (argc < 1) {
@@ -215,76 +297,14 @@ static int CmdSmart(int argc, char **argv)
     MediaLib lib;
     if (OpenLib(lib, sub == "create") != 0)
         return 1;
-    if (sub == "list") {
-        std::vector<SmartPlaylist> lists;
-        if (lib.ListSmart(&lists) != 0) {
-            fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
-            return 1;
-        }
-        for (const SmartPlaylist &p : lists) {
-            printf("%s\t%s", p.name.c_str(), p.matchAny ? "any" : "all");
-            for (const SmartRule &r : p.rules)
-                printf("\t%s", SmartRuleText(r).c_str());
-            printf("\n");
-        }
-        return 0;
-    }
-    if (sub == "show" && argc == 2) {
-        SmartPlaylist p;
-        int rc = lib.FindSmart(argv[1], &p);
-        if (rc != 1) {
-            fprintf(stderr, "tarnlib: %s\n",
-                    rc == 0 ? (std::string("no smart playlist named \"") + argv[1] + "\"").c_str()
-                            : lib.LastError().c_str());
-            return 1;
-        }
-        std::vector<MediaSong> songs;
-        int total = 0;
-        if (lib.SmartSongs(p, &songs, 0, 0, &total) != 0) {
-            fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
-            return 1;
-        }
-        printf("# %s: %d songs\n", p.name.c_str(), total);
-        for (const MediaSong &s : songs)
-            PrintSong(s);
-        return 0;
-    }
-    if (sub == "create" && argc >= 3) {
-        SmartPlaylist p;
-        p.name = argv[1];
-        for (int i = 2; i < argc; i++) {
-            if (strcmp(argv[i], "--any") == 0) {
-                p.matchAny = true;
-                continue;
-            }
-            SmartRule r;
-            std::string why;
-            if (SmartRuleParse(argv[i], &r, &why) != 0) {
-                fprintf(stderr, "tarnlib: bad rule \"%s\": %s\n", argv[i], why.c_str());
-                return 2;
-            }
-            p.rules.push_back(r);
-        }
-        if (lib.SaveSmart(p) != 0) {
-            fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
-            return 1;
-        }
-        printf("Smart playlist \"%s\" saved with %zu rules\n", p.name.c_str(), p.rules.size());
-        return 0;
-    }
-    if (sub == "delete" && argc == 2) {
-        int rc = lib.DeleteSmart(argv[1]);
-        if (rc < 0) {
-            fprintf(stderr, "tarnlib: %s\n", lib.LastError().c_str());
-            return 1;
-        }
-        if (rc == 0) {
-            fprintf(stderr, "tarnlib: no smart playlist named \"%s\"\n", argv[1]);
-            return 1;
-        }
-        printf("Smart playlist \"%s\" deleted\n", argv[1]);
-        return 0;
-    }
+    if (sub == "list")
+        return SmartList(lib);
+    if (sub == "show" && argc == 2)
+        return SmartShow(lib, argv[1]);
+    if (sub == "create" && argc >= 3)
+        return SmartCreate(lib, argc, argv);
+    if (sub == "delete" && argc == 2)
+        return SmartDelete(lib, argv[1]);
     Usage();
     return 2;
 }

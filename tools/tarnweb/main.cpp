@@ -64,14 +64,20 @@ bool ParseInt(const char *text, int low, int high, int *out)
     return true;
 }
 
-}  // namespace
-
-int main(int argc, char **argv)
-{
-    TarnLogOpen("tarnweb");
+// What the command line asked for.
+struct WebArgs {
     SongServerOptions options;
     WebRemoteOptions remoteOptions;
-    bool portGiven = false, bindGiven = false, remoteOn = true;
+    bool portGiven = false;
+    bool bindGiven = false;
+    bool remoteOn = true;
+};
+
+// The options into args; -1 to go on, else the exit status (help, version
+// or a bad option, already printed).
+int ParseArgs(int argc, char **argv, WebArgs *args)
+{
+    SongServerOptions &options = args->options;
     for (int i = 1; i < argc; ++i) {
         std::string a = argv[i];
         const char *value = i + 1 < argc ? argv[i + 1] : nullptr;
@@ -86,19 +92,19 @@ int main(int argc, char **argv)
             options.verbose = true;
             continue;
         } else if (a == "--no-remote") {
-            remoteOn = false;
+            args->remoteOn = false;
             continue;
         } else if (!value) {
             fprintf(stderr, "tarnweb: %s needs a value (see --help)\n", a.c_str());
             return 2;
         } else if (a == "--port") {
             ok = ParseInt(value, 0, 65535, &options.port);
-            portGiven = ok;
+            args->portGiven = ok;
         } else if (a == "--bind") {
             options.bindAddress = value;
-            bindGiven = true;
+            args->bindGiven = true;
         } else if (a == "--www") {
-            remoteOptions.wwwDir = value;
+            args->remoteOptions.wwwDir = value;
         } else if (a == "--threads") {
             ok = ParseInt(value, 1, 256, &options.threads);
         } else if (a == "--max-per-client") {
@@ -119,56 +125,57 @@ int main(int argc, char **argv)
         }
         ++i;
     }
+    return -1;
+}
+
+// Address and port not given take the configuration's; 0, or -1 (printed)
+// when there is no port at all.
+int ApplyConfiguration(WebArgs *args)
+{
+    SongServerOptions &options = args->options;
     std::string conf = TarnPath(TARN_INFO_CONF);
-    if (!bindGiven) {
+    if (!args->bindGiven) {
         char bind[64] = "";
         if (TLIBCFileGetKeyValue(conf.c_str(), "web_bind", bind, sizeof(bind), 0) > 0)
             options.bindAddress = bind;
     }
-    if (!portGiven) {
+    if (!args->portGiven) {
         char port[16] = "";
         if (TLIBCFileGetKeyValue(conf.c_str(), "admin_port", port, sizeof(port), 0) <= 0 ||
             !ParseInt(port, 1, 65535, &options.port)) {
             fprintf(stderr, "tarnweb: no port: set admin_port in %s or pass --port\n", conf.c_str());
-            return 2;
+            return -1;
         }
     }
+    return 0;
+}
 
-    // Signals are taken by one thread; the server threads never see them.
-    sigset_t stopSignals;
-    sigemptyset(&stopSignals);
-    sigaddset(&stopSignals, SIGTERM);
-    sigaddset(&stopSignals, SIGINT);
-    pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
-    signal(SIGPIPE, SIG_IGN);
-
+// The web remote, or none (said on standard error and in the log) when it
+// cannot start; songs are served either way.
+std::unique_ptr<WebRemote> StartRemote(WebArgs *args)
+{
+    SongServerOptions &options = args->options;
+    WebRemoteOptions &remoteOptions = args->remoteOptions;
     std::unique_ptr<WebRemote> remote;
-    if (remoteOn) {
-        // Live status streams hold a worker each: they get threads of their own.
-        options.threads += remoteOptions.maxStreams;
-        if (!options.dbPath.empty())
-            MediaLibSetDefaultPath(options.dbPath);  // the playlist functions read it too
-        remoteOptions.dbPath = options.dbPath;
-        remote.reset(new WebRemote(remoteOptions));
-        std::string why;
-        if (remote->Init(&why) != 0) {
-            fprintf(stderr, "tarnweb: no web remote: %s (songs are served; --no-remote hides this)\n",
-                    why.c_str());
-            TarnLog("%s:%d No web remote: %s", "tarnweb", __LINE__, why.c_str());
-            remote.reset();
-        }
+    // Live status streams hold a worker each: they get threads of their own.
+    options.threads += remoteOptions.maxStreams;
+    if (!options.dbPath.empty())
+        MediaLibSetDefaultPath(options.dbPath);  // the playlist functions read it too
+    remoteOptions.dbPath = options.dbPath;
+    remote.reset(new WebRemote(remoteOptions));
+    std::string why;
+    if (remote->Init(&why) != 0) {
+        fprintf(stderr, "tarnweb: no web remote: %s (songs are served; --no-remote hides this)\n",
+                why.c_str());
+        TarnLog("%s:%d No web remote: %s", "tarnweb", __LINE__, why.c_str());
+        remote.reset();
     }
-    SongServer server(options);
-    if (remote)
-        remote->Register(server.Http());
-    int port = server.Bind();
-    if (port <= 0) {
-        fprintf(stderr, "tarnweb: cannot listen on %s:%d (in use, or not an address of this machine)\n",
-                options.bindAddress.c_str(), options.port);
-        TarnLog("%s:%d Cannot listen on %s:%d", "tarnweb", __LINE__, options.bindAddress.c_str(),
-                options.port);
-        return 1;
-    }
+    return remote;
+}
+
+// The lines that tell where the server listens.
+void PrintListening(const SongServerOptions &options, int port, bool remote)
+{
     printf("tarnweb: listening on %s:%d\n", options.bindAddress.c_str(), port);
     if (remote) {
         std::string host = options.bindAddress == "0.0.0.0" || options.bindAddress == "::"
@@ -178,9 +185,13 @@ int main(int argc, char **argv)
         printf("tarnweb: web remote at http://%s:%d/\n", host.c_str(), port);
     }
     fflush(stdout);
+}
 
+// Serves until one of stopSignals arrives (taken by a thread of its own);
+// the exit status.
+int ServeUntilStopped(SongServer &server, WebRemote *remoteP, sigset_t stopSignals)
+{
     std::atomic<bool> served(false);
-    WebRemote *remoteP = remote.get();
     std::thread waiter([&server, &served, stopSignals, remoteP] {
         int sig = 0;
         sigwait(&stopSignals, &sig);
@@ -203,4 +214,43 @@ int main(int argc, char **argv)
     }
     waiter.join();
     return r == 0 ? 0 : 1;
+}
+
+}  // namespace
+
+int main(int argc, char **argv)
+{
+    TarnLogOpen("tarnweb");
+    WebArgs args;
+    int status = ParseArgs(argc, argv, &args);
+    if (status >= 0)
+        return status;
+    if (ApplyConfiguration(&args) != 0)
+        return 2;
+    SongServerOptions &options = args.options;
+
+    // Signals are taken by one thread; the server threads never see them.
+    sigset_t stopSignals;
+    sigemptyset(&stopSignals);
+    sigaddset(&stopSignals, SIGTERM);
+    sigaddset(&stopSignals, SIGINT);
+    pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+
+    std::unique_ptr<WebRemote> remote;
+    if (args.remoteOn)
+        remote = StartRemote(&args);
+    SongServer server(options);
+    if (remote)
+        remote->Register(server.Http());
+    int port = server.Bind();
+    if (port <= 0) {
+        fprintf(stderr, "tarnweb: cannot listen on %s:%d (in use, or not an address of this machine)\n",
+                options.bindAddress.c_str(), options.port);
+        TarnLog("%s:%d Cannot listen on %s:%d", "tarnweb", __LINE__, options.bindAddress.c_str(),
+                options.port);
+        return 1;
+    }
+    PrintListening(options, port, remote != nullptr);
+    return ServeUntilStopped(server, remote.get(), stopSignals);
 }

@@ -67,87 +67,102 @@ void WebRemote::RegisterLibraryChangeApi(httplib::Server &server)
     using Req = const httplib::Request &;
     using Res = httplib::Response &;
 
-    // Adds songs: {"ids":[...]} or every song of {"artist":..,"album":..};
-    // "where": "end" (default), "next" (after the current song) or "play"
-    // (after the current song, and play the first of them now).
-    server.Post("/api/library/add", [this](Req req, Res res) {
-        Json::Value body;
-        std::string error;
-        if (!Body(req, res, &body))
-            return;
-        std::vector<uint32_t> ids;
-        if (body["ids"].isArray()) {
-            for (const Json::Value &id : body["ids"])
-                if (id.isNumeric() && id.asLargestInt() > 0 && id.asLargestInt() <= UINT32_MAX)
-                    ids.push_back(static_cast<uint32_t>(id.asLargestUInt()));
-        } else if (body.isMember("artist") || body.isMember("album")) {
-            Json::Value list;
-            if (library->Songs(body.get("artist", "").asString(), body.isMember("artist"),
-                               body.get("album", "").asString(), body.isMember("album"), 0,
-                               static_cast<int>(kMostSongsPerAdd), &list, &error) != 0)
-                return Error(res, 503, error);
-            for (const Json::Value &s : list["songs"])
-                ids.push_back(s["id"].asUInt());
-        }
-        if (ids.empty() || ids.size() > kMostSongsPerAdd)
-            return Error(res, 400, "ids: 1 to " + std::to_string(kMostSongsPerAdd) + " song ids of the library");
-        std::vector<MediaSong> songs;
-        if (library->SongsById(ids, &songs, &error) != 0)
-            return Error(res, 503, error);
-        if (songs.empty())
-            return Error(res, 404, "none of these songs is in the library");
-        std::string where = body.get("where", "end").asString();
-        Json::Value page;
-        if (QueuePage(0, 1, &page, &error) != 0)
-            return Error(res, 503, error);
-        int total = page.get("total", 0).asInt(), current = page.get("current", 0).asInt();
-        int at = where == "end" || total == 0 ? total : current + 1;
-        for (size_t i = 0; i < songs.size(); ++i) {
-            TARN_MEDIA_INFO info;
-            MediaSongToInfo(songs[i], &info);
-            SetCover(&info);
-            int pos = at + static_cast<int>(i);
-            bool ok = pos >= total + static_cast<int>(i) ? SendRecord(res, ACT_QUEUE_ADD, info, 0)
-                                                         : SendRecord(res, ACT_QUEUE_INSERT, info, pos);
-            if (!ok) {
-                hub->Kick();
-                return;
-            }
-        }
-        if (where == "play" && !Send(res, ACT_PLAY_INDEX, std::to_string(at)))
-            return;
-        hub->Kick();
-        Json::Value v(Json::objectValue);
-        v["added"] = static_cast<int>(songs.size());
-        v["at"] = at;
-        Ok(res, v);
-    });
+    server.Post("/api/library/add", [this](Req req, Res res) { AddLibrarySongs(req, res); });
     server.Get("/api/library/scan", [this](Req, Res res) { Reply(res, library->ScanState()); });
-    server.Post("/api/library/rescan", [this](Req, Res res) {
-        // The folders of music_dir (separated by ':'), else the library's own.
-        std::vector<std::string> folders;
-        std::string dirs = ConfValue(options.confPath, "music_dir");
-        for (size_t at = 0; at <= dirs.size();) {
-            size_t end = dirs.find(':', at);
-            if (end == std::string::npos)
-                end = dirs.size();
-            if (end > at)
-                folders.push_back(dirs.substr(at, end - at));
-            at = end + 1;
+    server.Post("/api/library/rescan", [this](Req, Res res) { RescanLibrary(res); });
+}
+
+// The song ids a library add names: {"ids":[...]} or every song of
+// {"artist":..,"album":..}. 0, or -1 with the library's error.
+int WebRemote::LibraryAddIds(const Json::Value &body, std::vector<uint32_t> *ids, std::string *error)
+{
+    if (body["ids"].isArray()) {
+        for (const Json::Value &id : body["ids"])
+            if (id.isNumeric() && id.asLargestInt() > 0 && id.asLargestInt() <= UINT32_MAX)
+                ids->push_back(static_cast<uint32_t>(id.asLargestUInt()));
+    } else if (body.isMember("artist") || body.isMember("album")) {
+        Json::Value list;
+        if (library->Songs(body.get("artist", "").asString(), body.isMember("artist"),
+                           body.get("album", "").asString(), body.isMember("album"), 0,
+                           static_cast<int>(kMostSongsPerAdd), &list, error) != 0)
+            return -1;
+        for (const Json::Value &s : list["songs"])
+            ids->push_back(s["id"].asUInt());
+    }
+    return 0;
+}
+
+// Adds songs: {"ids":[...]} or every song of {"artist":..,"album":..};
+// "where": "end" (default), "next" (after the current song) or "play"
+// (after the current song, and play the first of them now).
+void WebRemote::AddLibrarySongs(const httplib::Request &req, httplib::Response &res)
+{
+    Json::Value body;
+    std::string error;
+    if (!Body(req, res, &body))
+        return;
+    std::vector<uint32_t> ids;
+    if (LibraryAddIds(body, &ids, &error) != 0)
+        return Error(res, 503, error);
+    if (ids.empty() || ids.size() > kMostSongsPerAdd)
+        return Error(res, 400, "ids: 1 to " + std::to_string(kMostSongsPerAdd) + " song ids of the library");
+    std::vector<MediaSong> songs;
+    if (library->SongsById(ids, &songs, &error) != 0)
+        return Error(res, 503, error);
+    if (songs.empty())
+        return Error(res, 404, "none of these songs is in the library");
+    std::string where = body.get("where", "end").asString();
+    Json::Value page;
+    if (QueuePage(0, 1, &page, &error) != 0)
+        return Error(res, 503, error);
+    int total = page.get("total", 0).asInt(), current = page.get("current", 0).asInt();
+    int at = where == "end" || total == 0 ? total : current + 1;
+    for (size_t i = 0; i < songs.size(); ++i) {
+        TARN_MEDIA_INFO info;
+        MediaSongToInfo(songs[i], &info);
+        SetCover(&info);
+        int pos = at + static_cast<int>(i);
+        bool ok = pos >= total + static_cast<int>(i) ? SendRecord(res, ACT_QUEUE_ADD, info, 0)
+                                                     : SendRecord(res, ACT_QUEUE_INSERT, info, pos);
+        if (!ok) {
+            hub->Kick();
+            return;
         }
-        if (folders.empty() && !library->SongFolder().empty())
-            folders.push_back(library->SongFolder());
-        if (folders.empty())
-            return Error(res, 409, "no music folder known: set music_dir in " + options.confPath);
-        StatusHub *h = hub.get();
-        if (library->StartScan(folders, [h](const Json::Value &state) { h->Publish("scan", Compact(state)); }) != 0)
-            return Error(res, 409, "a scan is running already");
-        Json::Value v(Json::objectValue);
-        v["folder"] = folders[0];
-        for (const std::string &f : folders)
-            v["folders"].append(f);
-        Ok(res, v);
-    });
+    }
+    if (where == "play" && !Send(res, ACT_PLAY_INDEX, std::to_string(at)))
+        return;
+    hub->Kick();
+    Json::Value v(Json::objectValue);
+    v["added"] = static_cast<int>(songs.size());
+    v["at"] = at;
+    Ok(res, v);
+}
+
+// Scans the folders of music_dir (separated by ':'), else the library's own.
+void WebRemote::RescanLibrary(httplib::Response &res)
+{
+    std::vector<std::string> folders;
+    std::string dirs = ConfValue(options.confPath, "music_dir");
+    for (size_t at = 0; at <= dirs.size();) {
+        size_t end = dirs.find(':', at);
+        if (end == std::string::npos)
+            end = dirs.size();
+        if (end > at)
+            folders.push_back(dirs.substr(at, end - at));
+        at = end + 1;
+    }
+    if (folders.empty() && !library->SongFolder().empty())
+        folders.push_back(library->SongFolder());
+    if (folders.empty())
+        return Error(res, 409, "no music folder known: set music_dir in " + options.confPath);
+    StatusHub *h = hub.get();
+    if (library->StartScan(folders, [h](const Json::Value &state) { h->Publish("scan", Compact(state)); }) != 0)
+        return Error(res, 409, "a scan is running already");
+    Json::Value v(Json::objectValue);
+    v["folder"] = folders[0];
+    for (const std::string &f : folders)
+        v["folders"].append(f);
+    Ok(res, v);
 }
 
 void WebRemote::RegisterSourceApi(httplib::Server &server)

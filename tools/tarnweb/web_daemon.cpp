@@ -11,6 +11,7 @@
 
 #include "daemon/ctrl.h"
 #include "platform/tarn_env.h"
+#include "platform/tarn_shm.h"
 #include "platform/tarn_log.h"
 #include "tools/tarnweb/web_remote.h"
 
@@ -171,11 +172,8 @@ void StatusHub::Subscribe(int delta)
 int StatusHub::ReadSegment(PublishedStatusShm *out)
 {
     if (!segment) {
-        int id = shmget(TarnShmKeyPublished(), TARN_SHM_PUBLISHED_SIZE, 0);
-        if (id < 0)
-            return -1;
-        void *at = shmat(id, nullptr, SHM_RDONLY);
-        if (at == reinterpret_cast<void *>(-1))
+        void *at = TarnShmAttach(TarnShmKeyPublished(), TARN_SHM_PUBLISHED_SIZE, TARN_SHM_READONLY);
+        if (!at)
             return -1;
         segment = static_cast<const PublishedStatusShm *>(at);
     }

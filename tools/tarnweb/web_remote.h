@@ -227,6 +227,10 @@ private:
     void RegisterRadioEditApi(httplib::Server &server);
     void RegisterPlayersApi(httplib::Server &server);
     void RegisterEqualizerApi(httplib::Server &server);
+    // Handlers too long to stand inline (web_api_library.cpp).
+    int LibraryAddIds(const Json::Value &body, std::vector<uint32_t> *ids, std::string *error);
+    void AddLibrarySongs(const httplib::Request &req, httplib::Response &res);
+    void RescanLibrary(httplib::Response &res);
     WebRemoteOptions options;
     WebAssets assets;
     std::unique_ptr<WebGuard> guard;
