@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <ctime>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -119,8 +120,10 @@ void ControlConnections::Service()
         bool done = false;
         if (c.replying && c.ready)
             done = Flush(c);
-        if (!done && now >= c.deadline)
-            done = true;  // silent, or not taking its reply: closed without a line
+        // Silent, or not taking its reply: closed without a line. A request
+        // that arrived in time but waits behind others is still served.
+        if (!done && now >= c.deadline && (c.replying || !Delivered(c.fd)))
+            done = true;
         if (done) {
             close(c.fd);
             conns.erase(conns.begin() + static_cast<long>(i));
@@ -131,14 +134,26 @@ void ControlConnections::Service()
     }
 }
 
+bool ControlConnections::Delivered(int fd)
+{
+    int pending = 0;
+    return ioctl(fd, FIONREAD, &pending) == 0 && pending > 0;
+}
+
 int ControlConnections::TimeoutMs() const
 {
-    if (conns.empty())
-        return -1;
-    int64_t nearest = conns[0].deadline;
-    for (const Conn &c : conns)
-        if (c.deadline < nearest)
+    // Connections past their deadline that are still held have delivered
+    // their request and wake the loop through poll; they set no timer.
+    int64_t now = NowMs();
+    int64_t nearest = -1;
+    for (const Conn &c : conns) {
+        if (c.deadline <= now && !c.replying && Delivered(c.fd))
+            continue;
+        if (nearest < 0 || c.deadline < nearest)
             nearest = c.deadline;
+    }
+    if (nearest < 0)
+        return -1;
     int64_t left = nearest - NowMs();
     return left <= 0 ? 0 : static_cast<int>(left + 1);
 }

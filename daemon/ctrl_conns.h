@@ -1,7 +1,8 @@
 // The control connections the loop holds open. Each accepted connection is
 // non-blocking and has its own deadline: 0.5 s to deliver its request, then
 // 0.5 s to take its reply. A slow or silent client therefore never delays
-// another; at its deadline it is closed without a log line.
+// another; at its deadline it is closed without a log line, unless its
+// request arrived in time and only waits for its turn to be served.
 #ifndef TARN_CTRL_CONNS_H
 #define TARN_CTRL_CONNS_H
 
@@ -59,6 +60,8 @@ private:
         bool ready;
     };
     Conn *Find(int fd);
+    // True when bytes of the request wait to be read on fd.
+    static bool Delivered(int fd);
     // Writes what the socket takes; true when the reply is complete or the
     // client is gone.
     static bool Flush(Conn &c);

@@ -7,10 +7,13 @@
 #include <mutex>
 #include <string>
 #include <thread>
+#include <fcntl.h>
+#include <poll.h>
 #include <unistd.h>
 #include <vector>
 
 #include "daemon/ctrl.h"
+#include "daemon/ctrl_conns.h"
 #include "daemon/socket.h"
 #include "daemon/tarn_types.h"
 #include "platform/tarn_env.h"
@@ -125,6 +128,56 @@ TEST(Socket, EveryClientCallSendsItsActionAndParameter)
     EXPECT_EQ(1, h.CountLog("info:160 Bad parameters"));
     usleep(50000);
     EXPECT_EQ(expected.size(), fake.Requests().size());
+}
+
+// Held connections: a silent one is closed at its deadline, while a request
+// that arrived in time but was not yet served (the loop was busy) stays to be
+// served, and the loop's timer does not spin on it.
+TEST(Socket, HeldConnectionsCloseTheSilentAndKeepADeliveredRequest)
+{
+    tarntest::Harness h;
+    std::string path = TarnPath(TARN_CTRL_SOCKET);
+    int listenFd = SocketListen(path.c_str(), 8);
+    ASSERT_GE(listenFd, 0);
+    fcntl(listenFd, F_SETFL, fcntl(listenFd, F_GETFL) | O_NONBLOCK);  // as the daemon sets it
+    int error = 0;
+    int silent = CtrlConnectAt(path.c_str(), false, &error);
+    int sender = CtrlConnectAt(path.c_str(), false, &error);
+    ASSERT_GE(silent, 0) << strerror(error);
+    ASSERT_GE(sender, 0) << strerror(error);
+    ControlConnections conns;
+    int accepted = 0;
+    for (int i = 0; i < 100 && accepted < 2; ++i, usleep(1000))
+        accepted += conns.AcceptAll(listenFd);
+    ASSERT_EQ(2, accepted);
+    ControlRequest req = tarntest::MakeRequest(ACT_STOP);
+    ASSERT_EQ(static_cast<ssize_t>(sizeof(req)), write(sender, &req, sizeof(req)));
+    EXPECT_GT(conns.TimeoutMs(), 0);
+    usleep(650 * 1000);  // both deadlines pass while nothing is served
+    EXPECT_EQ(0, conns.TimeoutMs());
+    conns.Service();
+    ASSERT_EQ(1u, conns.Count());
+    EXPECT_EQ(-1, conns.TimeoutMs()) << "a delivered request needs no timer";
+    std::vector<struct pollfd> fds;
+    conns.AddPollFds(fds);
+    ASSERT_EQ(1u, fds.size());
+    ASSERT_EQ(1, poll(fds.data(), fds.size(), 1000));
+    conns.TakeReady(fds, 0);
+    int fd = conns.NextReadable();
+    ASSERT_GE(fd, 0);
+    ControlRequest got;
+    EXPECT_EQ(static_cast<ssize_t>(sizeof(got)), read(fd, &got, sizeof(got)));
+    EXPECT_EQ(ACT_STOP, got.action);
+    char reply[CTRL_REPLY_SIZE] = "null\n";
+    conns.Reply(fd, reply, sizeof(reply));
+    EXPECT_EQ(0u, conns.Count());
+    std::string text;
+    EXPECT_EQ(static_cast<size_t>(CTRL_REPLY_SIZE), CtrlReadUntilClosed(sender, 1000, &text));
+    char byte;
+    EXPECT_EQ(0, read(silent, &byte, 1)) << "the silent client was closed";
+    close(silent);
+    close(sender);
+    close(listenFd);
 }
 
 }  // namespace
