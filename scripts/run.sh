@@ -180,7 +180,7 @@ HOST=$(hostname -I 2>/dev/null | awk '{print $1}')
 echo "run: web remote: http://${HOST:-localhost}:$PORT/   (tarnweb, pid $WEBPID)"
 
 "$BIN/tarnctl" source random > /dev/null || echo "run: the library has no songs to play"
-"$BIN/tarnctl" play 0 > /dev/null
+"$BIN/tarnctl" play 1 > /dev/null
 "$BIN/tarnctl" queue
 echo "run: audio output: ${TARN_AUDIO_OUT:-default}"
 CTL="$BIN/tarnctl"
