@@ -13,6 +13,7 @@
 #include <sys/select.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
+#include <ctime>
 #include <unistd.h>
 
 #include "audio/info.h"
@@ -68,6 +69,21 @@ std::string LocalPlayer::LoadFileCommand(const std::string &uri)
     return cmd;
 }
 
+namespace {
+
+// How long a started player process may take to connect (a first start
+// builds GStreamer's plugin registry) before another start replaces it.
+const int64_t kConnectWaitMs = 10000;
+
+int64_t MonotonicMs()
+{
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<int64_t>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+}
+
+}  // namespace
+
 LocalPlayer::LocalPlayer()
     : state(PLAYER_STATE_NONE),
       playlist(new Playlist()),
@@ -79,7 +95,8 @@ LocalPlayer::LocalPlayer()
       errorCount(0),
       failSerialSeen(0),
       failedInARow(0),
-      muted(false)
+      muted(false),
+      startedAtMs(0)
 {
     int stored = VolumeConfGet();
     if (stored != -1)
@@ -102,6 +119,13 @@ int LocalPlayer::AttachMplayerFd(int fd)
     mplayerFd = fd;
     // A new process counts its failure reports from 0.
     failSerialSeen = 0;
+    startedAtMs = 0;
+    if (!pendingUri.empty()) {
+        std::string uri;
+        uri.swap(pendingUri);
+        if (LoadFile(uri) != 0)
+            TLOG("Failed to load file [%s]", uri.c_str());
+    }
     return 0;
 }
 
@@ -292,11 +316,14 @@ int LocalPlayer::StartMplayer(const std::string &uri)
     for (std::string &a : args)
         argv.push_back(&a[0]);
     argv.push_back(nullptr);
+    pendingUri.clear();
     if (TLIBCExecv(exe.c_str(), argv.data(), 1) == -1) {
         TLOG("Failed to start MPlayer");
         SetError("cannot start the player program " + exe);
+        startedAtMs = 0;
         return -1;
     }
+    startedAtMs = MonotonicMs();
     return 0;
 }
 
@@ -323,6 +350,9 @@ int LocalPlayer::PlayPause()
         }
         return 0;
     }
+    // The process started a moment ago is still coming up: it plays.
+    if (StartPending())
+        return 0;
     std::string uri;
     if (playlist->GetCurrentUri(uri) != 0) {
         TLOG("Failed to get current song in playlist.");
@@ -418,6 +448,11 @@ int LocalPlayer::PlayIndex(const char *text)
             TLOG("Failed to load file [%s]", uri.c_str());
             return -1;
         }
+        return 0;
+    }
+    if (StartPending()) {
+        pendingUri = uri;
+        state = PLAYER_STATE_PLAYING;
         return 0;
     }
     if (PlayPause() != 0) {
@@ -622,6 +657,11 @@ void LocalPlayer::OnMplayerClosed()
     // It is our child when we started it: collect its exit status.
     while (waitpid(-1, nullptr, WNOHANG) > 0) {
     }
+}
+
+bool LocalPlayer::StartPending() const
+{
+    return mplayerFd < 0 && startedAtMs > 0 && MonotonicMs() - startedAtMs < kConnectWaitMs;
 }
 
 void LocalPlayer::SetError(const std::string &why)

@@ -87,6 +87,12 @@ private:
     int32_t failSerialSeen;  // mplayer-daemon's failure reports already taken
     unsigned failedInARow;   // songs that failed since one last played
     bool muted;              // as mplayer-daemon last reported it
+    // A player process started and not yet connected: a second start would
+    // kill it half-way; the song asked for meanwhile is loaded once it
+    // connects.
+    int64_t startedAtMs;     // 0: none waiting
+    std::string pendingUri;
+    bool StartPending() const;
     void SetError(const std::string &why);
 };
 

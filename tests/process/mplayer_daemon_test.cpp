@@ -251,6 +251,34 @@ TEST_F(LocalPlaybackTest, PauseSeekVolumeMuteAndEqualizerReachThePlayer)
     EXPECT_LT(wav.Seconds(), 20.0);  // the seek skipped audio
 }
 
+// A player process that is slow to come up (a first start builds
+// GStreamer's registry) is not started twice nor killed half-way by a second
+// play request: the song asked for meanwhile is loaded once it connects.
+TEST_F(LocalPlaybackTest, PlayWhileThePlayerStartsGoesToThatPlayer)
+{
+    Add("long-440.wav", "Long", 30.0f);
+    Add("tone-660.flac");
+    const std::string bin = h.Path(TARN_MPLAYER_BIN), starts = h.Path("/starts.log");
+    ASSERT_EQ(0, rename(bin.c_str(), (bin + ".real").c_str()));
+    ASSERT_EQ(0, h.WriteFile(TARN_MPLAYER_BIN, "#!/bin/sh\necho start >> '" + starts + "'\nsleep 1\nexec '" +
+                                                   bin + ".real' \"$@\"\n"));
+    ASSERT_EQ(0, chmod(bin.c_str(), 0755));
+
+    ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "0"));
+    usleep(200 * 1000);
+    ASSERT_EQ(0, h.Request(ACT_PLAY_INDEX, "1"));
+    const PublishedStatusShm *pub = h.PublishedSegment();
+    ASSERT_TRUE(WaitFor([&] { return pub && std::string(pub->currentUri) == Song("tone-660.flac") &&
+                                     Status()["Position"].asInt() >= 1; }, 10000))
+        << Status().toStyledString();
+    Json::Value s = Status();
+    EXPECT_EQ(PLAYER_STATE_PLAYING, s["PlayerState"].asInt());
+    EXPECT_EQ("", s["last_error"].asString());
+    EXPECT_EQ(0, s["error_count"].asInt());
+    EXPECT_EQ("start\n", h.ReadFile("/starts.log")) << "one player process";
+    StopAndWait();
+}
+
 // A stopped (SIGSTOP) or killed (SIGKILL) player never holds the daemon up.
 TEST_F(LocalPlaybackTest, HungOrKilledPlayerDoesNotBlockTheDaemon)
 {
