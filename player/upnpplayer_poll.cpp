@@ -132,14 +132,16 @@ void UpnpPlayer::ExpectNextAfter(int position)
 }
 
 // True once the renderer plays the song handed ahead: it names it, and its
-// position went back (or the song before is over by the clock). Naming it
-// alone is not enough: some renderers do as soon as they have it.
+// position went back to the start (or the song before is over by the
+// clock). Naming it alone is not enough: some renderers do as soon as they
+// have it. (A position a little lower than the furthest is not enough
+// either: two answers can come in the other order.)
 bool UpnpPlayer::MovedOnToNext(RENDERER_INFO *r)
 {
     if (nextUrl.empty() || nextUrl == playingUrl)
         return false;
     bool named = r->current_uri == nextUrl;
-    if (named && r->rel_time < nextTopRel)
+    if (named && r->rel_time < nextTopRel && r->rel_time <= 1)
         return true;
     nextTopRel = std::max(nextTopRel, r->rel_time);
     if (!named)
