@@ -41,6 +41,9 @@ UpnpPlayer::UpnpPlayer(UpnpController *controller, int rendererIndex)
       jobStarted(0),
       nextDirty(false),
       nextRefused(false),
+      nextTopRel(0),
+      nextDueMs(0),
+      positionAskedMs(0),
       playingReportsAtStart(0),
       goneSince(0),
       wasSelected(false),
@@ -245,6 +248,9 @@ int UpnpPlayer::PlayPause()
             return -1;
         }
         SetState(PLAYER_STATE_PLAYING);
+        // The song before the one handed ahead ends later by the pause.
+        if (!nextUrl.empty() && renderer)
+            ExpectNextAfter(renderer->rel_time);
     } else {
         return PlayCurrent();
     }
@@ -322,9 +328,15 @@ int UpnpPlayer::Seek(const char *text)
         TLOG("Bad parameter");
         return -1;
     }
-    if (controller->Seek(static_cast<int>(strtol(text, nullptr, 10))) != 0) {
+    int position = static_cast<int>(strtol(text, nullptr, 10));
+    if (controller->Seek(position) != 0) {
         TLOG("Failed to seek [%s]", text);
         return -1;
+    }
+    // A position gone back is not the move to the song handed ahead.
+    if (!nextUrl.empty() && renderer) {
+        renderer->rel_time = position;
+        ExpectNextAfter(position);
     }
     return 0;
 }

@@ -58,7 +58,9 @@ private:
     int StartJob(int kind, const std::vector<RendererAction> &steps, const std::string &url);
     void FinishJob(RENDERER_INFO *r);
     int HandNext(RENDERER_INFO *r);
-    void FollowNext(RENDERER_INFO *r);
+    void FollowNext();
+    bool MovedOnToNext(RENDERER_INFO *r);
+    void ExpectNextAfter(int position);
     int SongUrlAndMetadata(const TARN_MEDIA_INFO *song, std::string &url, std::string &metadata);
 
     int32_t state;
@@ -84,6 +86,15 @@ private:
     std::string nextUrl;     // the URL handed as the next song
     bool nextDirty;          // the queue changed after nextUrl was handed
     bool nextRefused;        // the renderer refused a next song for this one
+    // Some renderers name the song handed ahead as soon as they have it,
+    // while the one before still plays: the renderer has moved on to it once
+    // its position went back from the furthest seen since it was handed
+    // (nextTopRel, seconds), or once the song before is over by the clock
+    // (nextDueMs, monotonic). The position is asked every little while
+    // meanwhile (positionAskedMs).
+    int32_t nextTopRel;
+    long long nextDueMs;
+    long long positionAskedMs;
     // The renderer's count of PLAYING reports when this song was started:
     // a later one means it really played, so a STOPPED is the song's end.
     uint32_t playingReportsAtStart;

@@ -16,6 +16,12 @@ const int kJobGiveUpSeconds = 40;
 // The next song is handed to the renderer this long before the end.
 const int kHandNextBeforeEndSeconds = 2;
 
+// While the renderer names the song handed ahead but its position has not
+// gone back yet, the position is asked this often; by the clock, the song
+// before is over this long after its end was due.
+const long long kMovedOnAskMs = 200;
+const long long kMovedOnGraceMs = 1500;
+
 // What the player's job does.
 enum {
     JOB_NONE = 0,

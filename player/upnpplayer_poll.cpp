@@ -76,6 +76,8 @@ void UpnpPlayer::FinishJob(RENDERER_INFO *r)
     case JOB_NEXT:
         if (ok) {
             nextUrl = url;
+            if (!url.empty())
+                ExpectNextAfter(r->rel_time);
         } else {
             TLOG("Failed to set next uri [%s]", url.c_str());
             nextRefused = true;
@@ -118,14 +120,51 @@ int UpnpPlayer::HandNext(RENDERER_INFO *r)
     return 0;
 }
 
-// The renderer went on to the song handed ahead: the queue follows.
-void UpnpPlayer::FollowNext(RENDERER_INFO *r)
+// The song handed ahead is due after the rest of the playing one, which is
+// at position (seconds, as the renderer last told); the furthest position
+// seen starts there.
+void UpnpPlayer::ExpectNextAfter(int position)
+{
+    nextTopRel = position;
+    int now = EstimateRelTime(position);
+    int left = renderer && renderer->duration > now ? renderer->duration - now : 0;
+    nextDueMs = MonotonicMs() + left * 1000LL + kMovedOnGraceMs;
+}
+
+// True once the renderer plays the song handed ahead: it names it, and its
+// position went back to the start (or the song before is over by the
+// clock). Naming it alone is not enough: some renderers do as soon as they
+// have it. (A position a little lower than the furthest is not enough
+// either: two answers can come in the other order.)
+bool UpnpPlayer::MovedOnToNext(RENDERER_INFO *r)
+{
+    if (nextUrl.empty() || nextUrl == playingUrl)
+        return false;
+    bool named = r->current_uri == nextUrl;
+    if (named && r->rel_time < nextTopRel && r->rel_time <= 1)
+        return true;
+    nextTopRel = std::max(nextTopRel, r->rel_time);
+    if (!named)
+        return false;
+    long long now = MonotonicMs();
+    if (state == PLAYER_STATE_PLAYING && now >= nextDueMs)
+        return true;
+    if (now - positionAskedMs >= kMovedOnAskMs) {
+        positionAskedMs = now;
+        controller->GetPositionInfo();
+    }
+    return false;
+}
+
+// The renderer went on to the song handed ahead: the queue follows. The
+// renderer plays it already, so the count of PLAYING reports stays where
+// it was: its next STOPPED is this song's end.
+void UpnpPlayer::FollowNext()
 {
     std::string uri;
     playlist->Next(uri, true);
     playingUrl = nextUrl;
     nextUrl.clear();
-    playingReportsAtStart = r->playing_reports;
     SetState(PLAYER_STATE_PLAYING);
     playStarted = 1;
 }
@@ -209,9 +248,8 @@ int UpnpPlayer::Poll()
     }
     if (playStarted == 1 && jobKind == JOB_NONE) {
         bool played = r->playing_reports != playingReportsAtStart;
-        if (!nextUrl.empty() && r->current_uri == nextUrl && nextUrl != playingUrl) {
-            // The renderer moved on to the song handed ahead.
-            FollowNext(r);
+        if (MovedOnToNext(r)) {
+            FollowNext();
         } else if (state == PLAYER_STATE_STOPPED && played) {
             // It played and stopped: the song ended (the renderer said so
             // in an event or an answer). The queue moves on at once.
