@@ -219,7 +219,8 @@ struct Ours {
             return false;
         }
         std::string data;
-        CtrlReadUntilClosed(fd, 5000, &data);
+        // Done with the whole reply, as the other daemon's is done at "OK".
+        CtrlReadUntilClosed(fd, 5000, &data, CTRL_REPLY_SIZE);
         close(fd);
         if (data.empty())
             return false;

@@ -104,11 +104,11 @@ int CtrlConnectWhy(int *error)
     return fd;
 }
 
-size_t CtrlReadUntilClosed(int fd, int timeoutMs, std::string *data)
+size_t CtrlReadUntilClosed(int fd, int timeoutMs, std::string *data, size_t atMost)
 {
     using Clock = std::chrono::steady_clock;
     Clock::time_point end = Clock::now() + std::chrono::milliseconds(timeoutMs);
-    for (;;) {
+    while (atMost == 0 || data->size() < atMost) {
         long long left =
             std::chrono::duration_cast<std::chrono::milliseconds>(end - Clock::now()).count();
         if (left <= 0)
@@ -120,7 +120,10 @@ size_t CtrlReadUntilClosed(int fd, int timeoutMs, std::string *data)
         if (r <= 0)
             break;
         char buf[8192];
-        ssize_t n = read(fd, buf, sizeof(buf));
+        size_t want = sizeof(buf);
+        if (atMost > 0 && atMost - data->size() < want)
+            want = atMost - data->size();
+        ssize_t n = read(fd, buf, want);
         if (n <= 0)
             break;
         data->append(buf, static_cast<size_t>(n));
