@@ -21,6 +21,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
+#include <sched.h>
 #include <fstream>
 #include <sstream>
 #include <string>
@@ -602,34 +603,82 @@ void PrintTable()
 
 // ---------------------------------------------------------------------------
 // Measurements.
+
+// Pins every thread of pid (pid 0: the calling thread) to one CPU, or with
+// cpu < 0 lets it run on all of them again. On a virtual machine a wake-up
+// across CPUs costs several times a wake-up on the same one, and where the
+// scheduler puts a client and a daemon decides a whole run.
+void Pin(pid_t pid, int cpu)
+{
+    cpu_set_t set;
+    CPU_ZERO(&set);
+    long cpus = sysconf(_SC_NPROCESSORS_ONLN);
+    for (long c = 0; c < cpus && c < CPU_SETSIZE; ++c)
+        if (cpu < 0 || c == cpu)
+            CPU_SET(c, &set);
+    if (pid == 0) {
+        sched_setaffinity(0, sizeof(set), &set);
+        return;
+    }
+    DIR *d = opendir(("/proc/" + std::to_string(pid) + "/task").c_str());
+    if (!d)
+        return;
+    while (struct dirent *e = readdir(d)) {
+        int tid = atoi(e->d_name);
+        if (tid > 0)
+            sched_setaffinity(tid, sizeof(set), &set);
+    }
+    closedir(d);
+}
+
+// n fresh-connection status requests to each daemon, times in us.
+void MeasureRoundTrips(Ours &o, Mpd &m, int n, std::vector<double> *to, std::vector<double> *tm)
+{
+    for (int i = 0; i < n; ++i) {
+        auto t0 = Clock::now();
+        if (!o.Text(ACT_GET_STATUS, ""))
+            Die("tarnaudiod stopped answering during the round-trip run");
+        to->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    }
+    for (int i = 0; i < n; ++i) {
+        auto t0 = Clock::now();
+        if (!m.Fresh("status"))
+            Die("mpd stopped answering during the round-trip run");
+        tm->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    }
+}
+
+// Round trips where the scheduler puts them, then with the client and both
+// daemons on CPU 0.
 void RoundTrips(Ours &o, Mpd &m, int repeats)
 {
     int n = g_quick ? 500 : 5000;
-    std::vector<double> o50, o99, m50, m99;
+    std::vector<double> o50, o99, m50, m99, p50o, p50m;
     for (int r = 0; r < repeats; ++r) {
         Progress("round trips, run %d/%d (%d requests each side)", r + 1, repeats, n);
         std::vector<double> to, tm;
-        to.reserve(n);
-        tm.reserve(n);
-        for (int i = 0; i < n; ++i) {
-            auto t0 = Clock::now();
-            if (!o.Text(ACT_GET_STATUS, ""))
-                Die("tarnaudiod stopped answering during the round-trip run");
-            to.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
-        }
-        for (int i = 0; i < n; ++i) {
-            auto t0 = Clock::now();
-            if (!m.Fresh("status"))
-                Die("mpd stopped answering during the round-trip run");
-            tm.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
-        }
+        MeasureRoundTrips(o, m, n, &to, &tm);
         o50.push_back(Percentile(to, 50));
         o99.push_back(Percentile(to, 99));
         m50.push_back(Percentile(tm, 50));
         m99.push_back(Percentile(tm, 99));
     }
+    Pin(0, 0);
+    Pin(o.pid, 0);
+    Pin(m.pid, 0);
+    for (int r = 0; r < repeats; ++r) {
+        Progress("round trips on one CPU, run %d/%d (%d requests each side)", r + 1, repeats, n);
+        std::vector<double> to, tm;
+        MeasureRoundTrips(o, m, n, &to, &tm);
+        p50o.push_back(Percentile(to, 50));
+        p50m.push_back(Percentile(tm, 50));
+    }
+    Pin(0, -1);
+    Pin(o.pid, -1);
+    Pin(m.pid, -1);
     AddRow("control round trip p50, fresh connection", "us", o50, m50);
     AddRow("control round trip p99, fresh connection", "us", o99, m99);
+    AddRow("control round trip p50, client and daemons on one CPU", "us", p50o, p50m);
 }
 
 template <typename F>
