@@ -74,6 +74,8 @@ namespace {
 // How long a started player process may take to connect (a first start
 // builds GStreamer's plugin registry) before another start replaces it.
 const int64_t kConnectWaitMs = 10000;
+// How long it may take to write its pid file.
+const int64_t kPidFileWaitMs = 2000;
 
 int64_t MonotonicMs()
 {
@@ -270,12 +272,16 @@ void LocalPlayer::KillMplayer()
 {
     TLIBCProcSignalByPidFile(TarnPath(TARN_MPLAYER_PID_FILE).c_str(), SIGTERM);
     CloseMplayerFd();
+    startedAtMs = 0;
+    pendingUri.clear();
 }
 
 void LocalPlayer::KillByName()
 {
     TLIBCKill("mplayer-daemon", 0);
     CloseMplayerFd();
+    startedAtMs = 0;
+    pendingUri.clear();
 }
 
 void LocalPlayer::CloseMplayerFd()
@@ -659,9 +665,14 @@ void LocalPlayer::OnMplayerClosed()
     }
 }
 
-bool LocalPlayer::StartPending() const
+bool LocalPlayer::StartPending()
 {
-    return mplayerFd < 0 && startedAtMs > 0 && MonotonicMs() - startedAtMs < kConnectWaitMs;
+    if (mplayerFd >= 0 || startedAtMs == 0)
+        return false;
+    int64_t age = MonotonicMs() - startedAtMs;
+    // The process writes its pid file first thing; past the first moments
+    // one that is not alive ended before it connected.
+    return age < kConnectWaitMs && (age < kPidFileWaitMs || IsMplayerAlive());
 }
 
 void LocalPlayer::SetError(const std::string &why)

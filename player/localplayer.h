@@ -92,7 +92,7 @@ private:
     // connects.
     int64_t startedAtMs;     // 0: none waiting
     std::string pendingUri;
-    bool StartPending() const;
+    bool StartPending();
     void SetError(const std::string &why);
 };
 

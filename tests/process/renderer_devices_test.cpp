@@ -154,9 +154,10 @@ TEST_P(RendererDevices, FoundAtStartPlaysEverySongNeverHoldsTheDaemonAndKeepsIts
     // itself is handed ahead too (its end not left to the slow check).
     for (double s : switches)
         EXPECT_LT(s, kSongSeconds + 1.0) << "a pause between two songs";
+    // The access log has its line once the song's download ended.
+    WAIT(v["TransportState"] == "STOPPED", (kSongSeconds + 8) * 1000);
     EXPECT_NE(std::string::npos, h.ReadFile("/tmp/tarnweb-access.log").find(tokens[2]))
         << "the renderer never fetched the song queued by path";
-    WAIT(v["TransportState"] == "STOPPED", (kSongSeconds + 8) * 1000);
     EXPECT_EQ("", last["last_error"].asString());
 
     // Frozen renderer: play requests and status requests are answered at once.

@@ -254,4 +254,22 @@ TEST_F(SourceActionsTest, IpodTrackListAndNoNext)
     EXPECT_EQ("wave-c.wav tone-880.ogg ", Res());
 }
 
+// A source change while the player process is still coming up (a slow
+// first start) ends that process and plays the new source at once.
+TEST_F(SourceActionsTest, SourceChangeWhileThePlayerStartsPlaysTheNewSource)
+{
+    // The slow start: a script under the root (its shell too, so that the
+    // daemon, which ends only players of its own root, sees it as one).
+    const std::string bin = h.Path(TARN_MPLAYER_BIN), shell = bin + "-sh";
+    ASSERT_EQ(0, rename(bin.c_str(), (bin + ".real").c_str()));
+    ASSERT_EQ(0, h.Run({"/bin/cp", "/bin/sh", shell}));
+    ASSERT_EQ(0, h.WriteFile(TARN_MPLAYER_BIN, "#!" + shell + "\nsleep 1\nexec '" + bin + ".real' \"$@\"\n"));
+    ASSERT_EQ(0, chmod(bin.c_str(), 0755));
+    ASSERT_EQ(0, h.WriteFile("/usr/tarn/etc/audio/ipod/tracks.m3u", music + "/wave-c.wav\n"));
+    Source(ACT_SOURCE_PLAYLIST);
+    Source(ACT_SOURCE_IPOD);
+    EXPECT_EQ("wave-c.wav ", Res());
+    EXPECT_TRUE(WaitPlaying(music + "/wave-c.wav"));
+}
+
 }  // namespace
