@@ -20,7 +20,7 @@ static const char kLogUnit[] = "playlist";
 
 namespace {
 
-// Repeat mode names, indexed by the mode number.
+// Repeat mode names, indexed by the mode number (REPEAT_MODE_*).
 const char *const kModeNames[] = {"NONE", "Normal", "Repeat One", "Repeat All"};
 // Shown for a stored mode outside the table (SetMode stores any non-zero value).
 const char kModeUnknown[] = "Unknown";
@@ -37,7 +37,7 @@ std::string Field(const char (&text)[N])
 
 const char *ModeName(int32_t mode)
 {
-    if (mode < 0 || mode > 3)
+    if (mode < REPEAT_MODE_NONE || mode > REPEAT_MODE_ALL)
         return kModeUnknown;
     return kModeNames[mode];
 }
@@ -124,7 +124,7 @@ void QueueEntry::ToMediaInfo(TARN_MEDIA_INFO *out) const
     Put(out->albumArtUrl, albumArtUrl);
 }
 
-Playlist::Playlist() : current(0), orderIndex(0), mode(1), shuffle(false)
+Playlist::Playlist() : current(0), orderIndex(0), mode(REPEAT_MODE_OFF), shuffle(false)
 {
 }
 
@@ -288,13 +288,13 @@ int Playlist::SetCurrent(unsigned index)
 
 int Playlist::SetMode(int newMode)
 {
-    if (newMode == 0) {
+    if (newMode == REPEAT_MODE_NONE) {
         TLOG("Bad parameter");
         return -1;
     }
     mode = newMode;
     // Shuffle and "Repeat One" never stand together.
-    if (mode == 2 && shuffle)
+    if (mode == REPEAT_MODE_ONE && shuffle)
         ToggleShuffle();
     return 0;
 }
@@ -312,8 +312,8 @@ int Playlist::ToggleShuffle()
     } else {
         shuffle = true;
         ShuffleOrder();
-        if (mode == 2)
-            mode = 1;
+        if (mode == REPEAT_MODE_ONE)
+            mode = REPEAT_MODE_OFF;
     }
     return 0;
 }
@@ -321,12 +321,12 @@ int Playlist::ToggleShuffle()
 int Playlist::ToggleRepeatMode()
 {
     switch (mode) {
-    case 1:
-        return SetMode(2);
-    case 2:
-        return SetMode(3);
-    case 3:
-        return SetMode(1);
+    case REPEAT_MODE_OFF:
+        return SetMode(REPEAT_MODE_ONE);
+    case REPEAT_MODE_ONE:
+        return SetMode(REPEAT_MODE_ALL);
+    case REPEAT_MODE_ALL:
+        return SetMode(REPEAT_MODE_OFF);
     default:
         TLOG("Failed to toggle repeat mode. Invalid playlist mode [%d]", mode);
         return 0;
@@ -385,21 +385,21 @@ int Playlist::GetCurrentInfoJson(Json::Value &info)
 int Playlist::Next(std::string &uri, bool automatic)
 {
     size_t n = order.size();
-    if (n == 0 || mode < 1) {
+    if (n == 0 || mode < REPEAT_MODE_OFF) {
         TLOG("Cannot step forward: %zu songs, mode [%d]", n, mode);
         return -1;
     }
-    if (mode == 1 || (mode == 2 && !automatic)) {
+    if (mode == REPEAT_MODE_OFF || (mode == REPEAT_MODE_ONE && !automatic)) {
         if (orderIndex + 1 >= n) {
             TLOG("End of the playlist");
             return -1;
         }
         ++orderIndex;
-    } else if (mode == 2) {
+    } else if (mode == REPEAT_MODE_ONE) {
         // The song ended by itself: play it again.
         if (orderIndex >= n)
             orderIndex = 0;
-    } else if (mode == 3) {
+    } else if (mode == REPEAT_MODE_ALL) {
         ++orderIndex;
         if (orderIndex >= n)
             orderIndex = 0;
@@ -413,14 +413,14 @@ int Playlist::Next(std::string &uri, bool automatic)
 int Playlist::PeekNext(unsigned *entry) const
 {
     size_t n = order.size();
-    if (n == 0 || mode < 1 || mode > 3 || entry == nullptr)
+    if (n == 0 || mode < REPEAT_MODE_OFF || mode > REPEAT_MODE_ALL || entry == nullptr)
         return -1;
     size_t k = orderIndex >= n ? 0 : orderIndex;
-    if (mode == 1) {
+    if (mode == REPEAT_MODE_OFF) {
         if (k + 1 >= n)
             return -1;
         ++k;
-    } else if (mode == 3) {
+    } else if (mode == REPEAT_MODE_ALL) {
         k = (k + 1) % n;
     }
     int32_t e = order[k];
@@ -433,22 +433,22 @@ int Playlist::PeekNext(unsigned *entry) const
 int Playlist::Previous(std::string &uri, bool automatic)
 {
     size_t n = order.size();
-    if (n == 0 || mode < 1) {
+    if (n == 0 || mode < REPEAT_MODE_OFF) {
         TLOG("Cannot step back: %zu songs, mode [%d]", n, mode);
         return -1;
     }
-    if (mode == 3) {
+    if (mode == REPEAT_MODE_ALL) {
         if (orderIndex == 0)
             orderIndex = static_cast<uint32_t>(n - 1);
         else
             --orderIndex;
-    } else if (mode == 1 || (mode == 2 && !automatic)) {
+    } else if (mode == REPEAT_MODE_OFF || (mode == REPEAT_MODE_ONE && !automatic)) {
         if (orderIndex == 0) {
             TLOG("Beginning of the playlist");
             return -1;
         }
         --orderIndex;
-    } else if (mode == 2) {
+    } else if (mode == REPEAT_MODE_ONE) {
         if (orderIndex >= n)
             orderIndex = 0;
     } else {

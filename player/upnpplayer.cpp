@@ -274,7 +274,7 @@ int UpnpPlayer::Stop()
 
 int UpnpPlayer::Next(bool automatic)
 {
-    if (automatic && playlist->GetMode() == 2) {
+    if (automatic && playlist->GetMode() == REPEAT_MODE_ONE) {
         // The renderer still holds the song: play it again. When it refuses,
         // the song is handed over again (FinishJob).
         std::vector<RendererAction> steps;

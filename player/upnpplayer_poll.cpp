@@ -95,7 +95,7 @@ int UpnpPlayer::HandNext(RENDERER_INFO *r)
     nextDirty = false;
     unsigned entry = 0;
     std::string url, metadata;
-    if (playlist->GetMode() != 2 && playlist->PeekNext(&entry) == 0) {
+    if (playlist->GetMode() != REPEAT_MODE_ONE && playlist->PeekNext(&entry) == 0) {
         const QueueEntry *e = playlist->Entry(entry);
         TARN_MEDIA_INFO *song = new TARN_MEDIA_INFO;
         e->ToMediaInfo(song);
