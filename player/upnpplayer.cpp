@@ -16,7 +16,7 @@
 #include "platform/tarn_media_types.h"
 #include "platform/tarn_net.h"
 #include "platform/tlibc_conf.h"
-#include "player/playlist.h"
+#include "player/playlist_actions.h"
 #include "player/upnpplayer_internal.h"
 #include "upnp/upnp.h"
 #include "upnp/xml_util.h"
@@ -442,7 +442,7 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     case ACT_SET_REPEAT_MODE:
     case ACT_TOGGLE_SHUFFLE:
     case ACT_QUEUE_LIST:
-        playlist->HandleAction(request, reply);
+        PlaylistHandleAction(*playlist, request, reply);
         // The song handed ahead may no longer be the one that follows.
         if (code != ACT_QUEUE_LIST)
             nextDirty = true;
