@@ -20,7 +20,7 @@
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_proc.h"
-#include "player/playlist.h"
+#include "player/playlist_actions.h"
 
 static const char kLogUnit[] = "localplayer";
 
@@ -199,7 +199,7 @@ int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     case ACT_TOGGLE_SHUFFLE:
     case ACT_QUEUE_LIST:
     case ACT_CYCLE_REPEAT_MODE:
-        playlist->HandleAction(request, reply);
+        PlaylistHandleAction(*playlist, request, reply);
         break;
     case ACT_SET_EQUALIZER:
         SetEqualizer(text);
@@ -614,7 +614,7 @@ int LocalPlayer::PublishStatus(PublishedStatusShm *segment)
     segment->state = static_cast<int32_t>(state);
 
     Json::Value info;
-    if (playlist->GetCurrentInfoJson(info) == 0) {
+    if (PlaylistCurrentInfoJson(*playlist, info) == 0) {
         segment->index = info["current"].asInt();
         snprintf(segment->title, sizeof(segment->title), "%s", info["title"].asString().c_str());
         snprintf(segment->artist, sizeof(segment->artist), "%s",
@@ -691,7 +691,7 @@ void LocalPlayer::SaveVolumeAndKill()
 int LocalPlayer::GetCurrentSong(std::string &path, std::string &title)
 {
     Json::Value info;
-    if (playlist->GetCurrentInfoJson(info) != 0)
+    if (PlaylistCurrentInfoJson(*playlist, info) != 0)
         return -1;
     path = info["path"].asString();
     title = info["title"].asString();

@@ -1,19 +1,22 @@
-// The play queue of one player.
+// The play queue of one player: songs, order, current entry, repeat mode
+// and shuffle. Its JSON views and control-request actions are in
+// player/playlist_actions.h.
 #ifndef TARN_PLAYLIST_H
 #define TARN_PLAYLIST_H
 
+#include <cstddef>
 #include <cstdint>
 #include <string>
 #include <vector>
 
-#include <json/json.h>
-
 #include "platform/tarn_media_info.h"
-#include "wire/tarn_wire.h"
 
 // Longest queue unless "audio_queue_max" of the configuration file says
 // otherwise (read once per process); a song beyond it is refused.
 #define PLAYLIST_DEFAULT_MAX 20000
+
+// The longest queue of this process.
+size_t PlaylistMaxSongs();
 
 // One queued song: what the daemon reads of a record, each text sized to
 // its content. A full record is rebuilt only where one is handed on.
@@ -44,6 +47,8 @@ public:
     int Clear();
     int InsertSong(unsigned index, const TARN_MEDIA_INFO *info);
     int SetCurrent(unsigned index);
+    // mode is one of REPEAT_MODE_* (wire/tarn_wire.h); any non-zero value is
+    // stored.
     int SetMode(int mode);
     int GetMode() const;
     int ToggleShuffle();
@@ -52,14 +57,11 @@ public:
     // Rebuilds the current entry's record into *out.
     int GetCurrentSong(TARN_MEDIA_INFO *out);
     int GetCurrentUri(std::string &uri);
-    int GetCurrentInfoJson(Json::Value &info);
     int Next(std::string &uri, bool automatic);
     int Previous(std::string &uri, bool automatic);
     // The entry that Next(uri, true) would move to, without moving: 0 and
     // *entry, or -1 at the end of the queue ("Normal") or when it is empty.
     int PeekNext(unsigned *entry) const;
-    int ListJson(int start, int limit, Json::Value &reply);
-    int HandleAction(const ControlRequest *request, Json::Value &reply);
 
     unsigned Count() const { return static_cast<unsigned>(entries.size()); }
     unsigned Current() const { return current; }

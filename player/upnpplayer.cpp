@@ -16,7 +16,7 @@
 #include "platform/tarn_media_types.h"
 #include "platform/tarn_net.h"
 #include "platform/tlibc_conf.h"
-#include "player/playlist.h"
+#include "player/playlist_actions.h"
 #include "player/upnpplayer_internal.h"
 #include "upnp/upnp.h"
 #include "upnp/xml_util.h"
@@ -274,7 +274,7 @@ int UpnpPlayer::Stop()
 
 int UpnpPlayer::Next(bool automatic)
 {
-    if (automatic && playlist->GetMode() == 2) {
+    if (automatic && playlist->GetMode() == REPEAT_MODE_ONE) {
         // The renderer still holds the song: play it again. When it refuses,
         // the song is handed over again (FinishJob).
         std::vector<RendererAction> steps;
@@ -442,7 +442,7 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     case ACT_SET_REPEAT_MODE:
     case ACT_TOGGLE_SHUFFLE:
     case ACT_QUEUE_LIST:
-        playlist->HandleAction(request, reply);
+        PlaylistHandleAction(*playlist, request, reply);
         // The song handed ahead may no longer be the one that follows.
         if (code != ACT_QUEUE_LIST)
             nextDirty = true;

@@ -16,7 +16,7 @@
 #include "platform/tarn_media_types.h"
 #include "platform/tarn_net.h"
 #include "platform/tlibc_conf.h"
-#include "player/playlist.h"
+#include "player/playlist_actions.h"
 #include "player/upnpplayer_internal.h"
 #include "upnp/upnp.h"
 #include "upnp/xml_util.h"
@@ -95,7 +95,7 @@ int UpnpPlayer::HandNext(RENDERER_INFO *r)
     nextDirty = false;
     unsigned entry = 0;
     std::string url, metadata;
-    if (playlist->GetMode() != 2 && playlist->PeekNext(&entry) == 0) {
+    if (playlist->GetMode() != REPEAT_MODE_ONE && playlist->PeekNext(&entry) == 0) {
         const QueueEntry *e = playlist->Entry(entry);
         TARN_MEDIA_INFO *song = new TARN_MEDIA_INFO;
         e->ToMediaInfo(song);
@@ -308,7 +308,7 @@ int UpnpPlayer::PublishStatus(PublishedStatusShm *segment)
     segment->repeatMode = playlist->GetMode();
     segment->state = state;
     Json::Value info;
-    if (playlist->GetCurrentInfoJson(info) == 0) {
+    if (PlaylistCurrentInfoJson(*playlist, info) == 0) {
         if (info.isMember("current"))
             segment->index = info["current"].asInt();
         if (info.isMember("title"))

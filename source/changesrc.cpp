@@ -25,9 +25,9 @@
 
 static const char kLogUnit[] = "changesrc";
 
-// The source the local queue was last filled from (0,1,2,3,4,6), and the
-// saved playlist of source type 4: the source change's own state.
-static int g_sourceType = 0;
+// The source the local queue was last filled from (SOURCE_TYPE_*), and the
+// saved playlist of SOURCE_TYPE_PLAYLIST: the source change's own state.
+static int g_sourceType = SOURCE_TYPE_NONE;
 static char g_currentPlaylistPath[4096] = "";
 
 #define RANDOM_PLAYLIST_FORMAT "/tmp/==DynaRandom100==.%s"
@@ -228,9 +228,9 @@ int ChangeSourceStep(LocalPlayer *player, int step)
         TLOG("Bad parameter.");
         return -1;
     }
-    if (g_sourceType == 1)
+    if (g_sourceType == SOURCE_TYPE_RANDOM)
         return ChangeSourceRandom100(player, true);
-    if (g_sourceType != 4)
+    if (g_sourceType != SOURCE_TYPE_PLAYLIST)
         return -1;
     if (!g_currentPlaylistPath[0]) {
         TLOG("source in playlist, but no path");
@@ -256,7 +256,7 @@ int ChangeSourceStep(LocalPlayer *player, int step)
     size_t chosen = step > 0 ? (found + 1) % n : (found + n - 1) % n;
     std::string path = lists[chosen].path;
     QueuePlaylistByPath(path.c_str(), player);
-    g_sourceType = 4;
+    g_sourceType = SOURCE_TYPE_PLAYLIST;
     snprintf(g_currentPlaylistPath, sizeof(g_currentPlaylistPath), "%s", path.c_str());
     return 0;
 }
@@ -291,7 +291,7 @@ int ChangeSourceRandom100(LocalPlayer *player, bool regenerate)
         QueueAdd(player, &song);
     }
     RestartLocalPlayback(player);
-    g_sourceType = 1;
+    g_sourceType = SOURCE_TYPE_RANDOM;
     return 0;
 }
 
@@ -319,7 +319,7 @@ int ChangeSourceRadio(LocalPlayer *player)
         QueueAdd(player, info.get());
     }
     RestartLocalPlayback(player);
-    g_sourceType = 2;
+    g_sourceType = SOURCE_TYPE_RADIO;
     return 0;
 }
 
@@ -338,7 +338,7 @@ int ChangeSourceIPod(LocalPlayer *player)
     for (const TARN_MEDIA_INFO &track : tracks)
         QueueAdd(player, &track);
     RestartLocalPlayback(player);
-    g_sourceType = 3;
+    g_sourceType = SOURCE_TYPE_IPOD;
     return 0;
 }
 
@@ -361,7 +361,7 @@ int ChangeSourceFirstPlaylist(LocalPlayer *player)
         TLOG("Failed to change source to playlist [%s]", g_currentPlaylistPath);
         return -1;
     }
-    g_sourceType = 4;
+    g_sourceType = SOURCE_TYPE_PLAYLIST;
     snprintf(g_currentPlaylistPath, sizeof(g_currentPlaylistPath), "%s", path.c_str());
     return 0;
 }
@@ -387,7 +387,7 @@ int ChangeSourceCustom(int slot, LocalPlayer *player)
         TLOG("invalid custom type [%s]", type.c_str());
         return -1;
     }
-    g_sourceType = 6;
+    g_sourceType = SOURCE_TYPE_CUSTOM;
     return 0;
 }
 
@@ -408,13 +408,13 @@ int SaveCustomSource(int slot, LocalPlayer *player)
         return -1;
     }
     int rc;
-    if (g_sourceType == 4) {
+    if (g_sourceType == SOURCE_TYPE_PLAYLIST) {
         char title[255];
         memset(title, 0, sizeof(title));
         if (TARNPlaylistTitleGetByPath(g_currentPlaylistPath, title, 255) != 0)
             return -1;
         rc = TARNAudioCustomSet(slot, "playlist", g_currentPlaylistPath, title);
-    } else if (g_sourceType == 2) {
+    } else if (g_sourceType == SOURCE_TYPE_RADIO) {
         std::string path, title;
         if (player->GetCurrentSong(path, title) != 0)
             return -1;

@@ -6,8 +6,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include <curl/curl.h>
-
+#include "platform/http_fetch.h"
 #include "platform/json_read.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
@@ -24,23 +23,6 @@ const long kMaxTotalTimeoutSeconds = 120;
 const size_t kMaxBodyBytes = 4 * 1024 * 1024;
 const int kDefaultLimit = 100;
 const int kMaxLimit = 1000;
-
-struct Body {
-    std::string *text;
-    bool tooLarge;
-};
-
-size_t WriteBody(char *data, size_t size, size_t count, void *user)
-{
-    Body *body = static_cast<Body *>(user);
-    size_t n = size * count;
-    if (body->text->size() + n > kMaxBodyBytes) {
-        body->tooLarge = true;
-        return 0;  // aborts the transfer
-    }
-    body->text->append(data, n);
-    return n;
-}
 
 // Directory base URL without a trailing slash; "" when none is configured.
 std::string DirectoryBase()
@@ -122,50 +104,30 @@ int RadioDirectoryFetch(const std::string &url, std::string &body)
 
 int RadioDirectoryFetch(const std::string &url, std::string &body, long timeoutSeconds)
 {
-    body.clear();
-    CURL *curl = curl_easy_init();
-    if (!curl) {
-        TLOG("Failed to start an HTTP transfer for [%s]", url.c_str());
-        return -1;
-    }
-    Body sink = {&body, false};
-    char error[CURL_ERROR_SIZE] = "";
-    curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
-    curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
     if (timeoutSeconds < 1)
         timeoutSeconds = 1;
-    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT,
-                     timeoutSeconds < kConnectTimeoutSeconds ? timeoutSeconds : kConnectTimeoutSeconds);
-    curl_easy_setopt(curl, CURLOPT_TIMEOUT, timeoutSeconds);
-    curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L);
-    curl_easy_setopt(curl, CURLOPT_MAXREDIRS, 3L);
-    curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http,https");
-    curl_easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, "http,https");
-    curl_easy_setopt(curl, CURLOPT_MAXFILESIZE, static_cast<long>(kMaxBodyBytes));
-    curl_easy_setopt(curl, CURLOPT_USERAGENT, "tarnaudiod/1.0");
-    curl_easy_setopt(curl, CURLOPT_ACCEPT_ENCODING, "");
-    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, WriteBody);
-    curl_easy_setopt(curl, CURLOPT_WRITEDATA, &sink);
-    curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, error);
-
-    CURLcode rc = curl_easy_perform(curl);
-    long status = 0;
-    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
-    curl_easy_cleanup(curl);
-
-    if (sink.tooLarge || rc == CURLE_FILESIZE_EXCEEDED) {
-        TLOG("Radio directory answer from [%s] is larger than %zu bytes", url.c_str(),
-             kMaxBodyBytes);
-        body.clear();
+    HttpFetchOptions options;
+    options.maxBytes = kMaxBodyBytes;
+    options.connectTimeoutSeconds =
+        timeoutSeconds < kConnectTimeoutSeconds ? timeoutSeconds : kConnectTimeoutSeconds;
+    options.timeoutSeconds = timeoutSeconds;
+    options.userAgent = "tarnaudiod/1.0";
+    options.protocols = "http,https";
+    options.maxRedirects = 3;
+    options.anyEncoding = true;
+    HttpFetchResult result;
+    if (HttpFetch(url, options, &body, &result) != 0) {
+        if (result.error == HTTP_FETCH_NO_HANDLE)
+            TLOG("Failed to start an HTTP transfer for [%s]", url.c_str());
+        else if (result.error == HTTP_FETCH_TOO_LARGE)
+            TLOG("Radio directory answer from [%s] is larger than %zu bytes", url.c_str(),
+                 kMaxBodyBytes);
+        else
+            TLOG("Failed to fetch [%s]: %s", url.c_str(), result.message.c_str());
         return -1;
     }
-    if (rc != CURLE_OK) {
-        TLOG("Failed to fetch [%s]: %s", url.c_str(), error[0] ? error : curl_easy_strerror(rc));
-        body.clear();
-        return -1;
-    }
-    if (status < 200 || status > 299) {
-        TLOG("Failed to fetch [%s]: HTTP status %ld", url.c_str(), status);
+    if (result.status < 200 || result.status > 299) {
+        TLOG("Failed to fetch [%s]: HTTP status %ld", url.c_str(), result.status);
         body.clear();
         return -1;
     }

@@ -5,13 +5,12 @@
 #include <atomic>
 #include <cstdio>
 #include <cstring>
-#include <vector>
 
-#include <curl/curl.h>
 #include <sys/utsname.h>
 
 #include "upnp/upnp_sdk.h"
 
+#include "platform/http_fetch.h"
 #include "platform/tarn_log.h"
 #include "platform/tarn_media_types.h"
 
@@ -298,29 +297,6 @@ namespace {
 // Set while the control point shuts down: running downloads give up.
 std::atomic<bool> g_abortDownloads{false};
 
-int CheckAbort(void *, curl_off_t, curl_off_t, curl_off_t, curl_off_t)
-{
-    return g_abortDownloads.load() ? 1 : 0;
-}
-
-// Collects a download's body up to the size limit.
-struct DownloadBody {
-    std::vector<char> data;
-    bool tooLarge = false;
-};
-
-size_t CollectBody(char *ptr, size_t size, size_t count, void *user)
-{
-    DownloadBody *body = static_cast<DownloadBody *>(user);
-    size_t n = size * count;
-    if (body->data.size() + n > static_cast<size_t>(kXmlMaxDocumentBytes)) {
-        body->tooLarge = true;
-        return 0;  // makes libcurl stop with CURLE_WRITE_ERROR
-    }
-    body->data.insert(body->data.end(), ptr, ptr + n);
-    return n;
-}
-
 }  // namespace
 
 const char *XmlUserAgent()
@@ -355,47 +331,38 @@ int XmlDownloadDoc(const char *url, IXML_Document **doc)
     if (url == nullptr || strncmp(url, "http://", 7) != 0)
         return UPNP_E_INVALID_URL;
 
-    CURL *curl = curl_easy_init();
-    if (curl == nullptr)
-        return UPNP_E_OUTOF_MEMORY;
-    DownloadBody body;
-    curl_easy_setopt(curl, CURLOPT_URL, url);
-    curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http");
-    curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 0L);
-    curl_easy_setopt(curl, CURLOPT_PROXY, "");
-    curl_easy_setopt(curl, CURLOPT_USERAGENT, XmlUserAgent());
-    curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L);
-    curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, kConnectSeconds);
-    curl_easy_setopt(curl, CURLOPT_TIMEOUT, kTotalSeconds);
-    curl_easy_setopt(curl, CURLOPT_MAXFILESIZE, static_cast<long>(kXmlMaxDocumentBytes));
-    curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, CollectBody);
-    curl_easy_setopt(curl, CURLOPT_WRITEDATA, &body);
-    curl_easy_setopt(curl, CURLOPT_XFERINFOFUNCTION, CheckAbort);
-    curl_easy_setopt(curl, CURLOPT_NOPROGRESS, 0L);
-    CURLcode res = curl_easy_perform(curl);
-    long status = 0;
-    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
-    curl_easy_cleanup(curl);
-
-    if (res != CURLE_OK) {
-        if (body.tooLarge || res == CURLE_FILESIZE_EXCEEDED)
+    HttpFetchOptions options;
+    options.maxBytes = kXmlMaxDocumentBytes;
+    options.connectTimeoutSeconds = kConnectSeconds;
+    options.timeoutSeconds = kTotalSeconds;
+    options.userAgent = XmlUserAgent();
+    options.protocols = "http";
+    options.noProxy = true;
+    options.abort = &g_abortDownloads;
+    std::string body;
+    HttpFetchResult result;
+    if (HttpFetch(url, options, &body, &result) != 0) {
+        switch (result.error) {
+        case HTTP_FETCH_NO_HANDLE:
+            return UPNP_E_OUTOF_MEMORY;
+        case HTTP_FETCH_TOO_LARGE:
             return UPNP_E_OUTOF_BOUNDS;
-        if (res == CURLE_COULDNT_CONNECT)
+        case HTTP_FETCH_CONNECT:
             return UPNP_E_SOCKET_CONNECT;
-        if (res == CURLE_ABORTED_BY_CALLBACK)
+        case HTTP_FETCH_ABORTED:
             return UPNP_E_CANCELED;
-        if (res == CURLE_OPERATION_TIMEDOUT)
+        case HTTP_FETCH_TIMEOUT:
             return UPNP_E_TIMEDOUT;
-        if (res == CURLE_URL_MALFORMAT || res == CURLE_COULDNT_RESOLVE_HOST ||
-            res == CURLE_UNSUPPORTED_PROTOCOL)
+        case HTTP_FETCH_BAD_URL:
             return UPNP_E_INVALID_URL;
-        return UPNP_E_BAD_RESPONSE;
+        default:
+            return UPNP_E_BAD_RESPONSE;
+        }
     }
-    if (status != 200)
+    if (result.status != 200)
         return UPNP_E_BAD_RESPONSE;
-    body.data.push_back('\0');
     IXML_Document *parsed = nullptr;
-    if (XmlParseGuarded(body.data.data(), &parsed) != IXML_SUCCESS || parsed == nullptr) {
+    if (XmlParseGuarded(body.c_str(), &parsed) != IXML_SUCCESS || parsed == nullptr) {
         if (parsed != nullptr)
             ixmlDocument_free(parsed);
         return UPNP_E_INVALID_DESC;

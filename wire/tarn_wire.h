@@ -133,6 +133,25 @@ enum {
     PLAYER_STATE_ENDED = 5,
 };
 
+// Repeat modes of a queue, as the published segment's repeatMode and
+// ACT_SET_REPEAT_MODE carry them. 0 is no mode (refused when set).
+enum {
+    REPEAT_MODE_NONE = 0,
+    REPEAT_MODE_OFF = 1,   // stop after the last song ("Normal")
+    REPEAT_MODE_ONE = 2,   // play the song again when it ends
+    REPEAT_MODE_ALL = 3,   // start the queue again after the last song
+};
+
+// Kinds of source the local queue was last filled from (there is no 5).
+enum {
+    SOURCE_TYPE_NONE = 0,
+    SOURCE_TYPE_RANDOM = 1,    // random selection
+    SOURCE_TYPE_RADIO = 2,     // radio list
+    SOURCE_TYPE_IPOD = 3,      // iPod track list
+    SOURCE_TYPE_PLAYLIST = 4,  // saved playlist
+    SOURCE_TYPE_CUSTOM = 6,    // custom slot
+};
+
 
 
 #endif

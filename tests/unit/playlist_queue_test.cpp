@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "player/playlist.h"
+#include "player/playlist_actions.h"
 #include "player/tarn_rand.h"
 #include "tests/harness/harness.h"
 
@@ -95,14 +95,14 @@ TEST_F(QueueTest, RepeatModesStepAsTheyShould)
     EXPECT_EQ(1, h.CountLog(" Bad parameter"));
     EXPECT_EQ(-4, p.GetMode());
     Json::Value reply;
-    ASSERT_EQ(0, p.ListJson(0, 1, reply));
+    ASSERT_EQ(0, PlaylistListJson(p, 0, 1, reply));
     EXPECT_EQ("Unknown", reply["mode"].asString());
     // The cycle Normal -> Repeat One -> Repeat All -> Normal, with its names.
     ASSERT_EQ(0, p.SetMode(1));
     const char *names[] = {"", "Normal", "Repeat One", "Repeat All"};
     for (int want : {2, 3, 1}) {
         ASSERT_EQ(0, p.ToggleRepeatMode());
-        ASSERT_EQ(0, p.ListJson(0, 0, reply));
+        ASSERT_EQ(0, PlaylistListJson(p, 0, 0, reply));
         EXPECT_EQ(names[want], reply["mode"].asString());
     }
 }
@@ -172,7 +172,7 @@ TEST_F(QueueTest, RemovingAndInsertingAroundTheCurrentSong)
     // The last song while current: the next read falls back to the first.
     ASSERT_EQ(0, p.RemoveSong(1));
     Json::Value info;
-    EXPECT_EQ(-1, p.GetCurrentInfoJson(info));
+    EXPECT_EQ(-1, PlaylistCurrentInfoJson(p, info));
     ASSERT_EQ(0, p.GetCurrentUri(uri));
     EXPECT_EQ(PathOf(1), uri);
     EXPECT_EQ(0u, p.Current());
@@ -221,7 +221,7 @@ std::string Seqs(const Json::Value &reply)
 TEST_F(QueueTest, ListPages)
 {
     Json::Value empty;
-    ASSERT_EQ(0, p.ListJson(0, 20, empty));
+    ASSERT_EQ(0, PlaylistListJson(p, 0, 20, empty));
     EXPECT_TRUE(empty["uris"].isArray());
     Fill(30);
     struct {
@@ -235,7 +235,7 @@ TEST_F(QueueTest, ListPages)
     };
     for (const auto &pg : pages) {
         Json::Value r;
-        EXPECT_EQ(0, p.ListJson(pg.start, pg.limit, r));
+        EXPECT_EQ(0, PlaylistListJson(p, pg.start, pg.limit, r));
         EXPECT_EQ(pg.seqs, Seqs(r)) << pg.start << " " << pg.limit;
         EXPECT_TRUE(r["uris"].isArray());
         EXPECT_EQ(30, r["total"].asInt());

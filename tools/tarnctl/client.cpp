@@ -129,8 +129,8 @@ const char *StateWord(int state)
 const char *RepeatWord(int mode)
 {
     switch (mode) {
-    case 2: return "one";
-    case 3: return "all";
+    case REPEAT_MODE_ONE: return "one";
+    case REPEAT_MODE_ALL: return "all";
     default: return "off";
     }
 }
@@ -138,10 +138,10 @@ const char *RepeatWord(int mode)
 int RepeatMode(const std::string &name)
 {
     if (name == "Repeat One")
-        return 2;
+        return REPEAT_MODE_ONE;
     if (name == "Repeat All")
-        return 3;
-    return 1;
+        return REPEAT_MODE_ALL;
+    return REPEAT_MODE_OFF;
 }
 
 int JsonInt(const Json::Value &v, const char *key, int fallback)

@@ -49,7 +49,7 @@ struct Snapshot {
     int errorCount = 0;
     std::string station, streamTitle;
     int total = 0, current = 0, orderIndex = 0;  // queue, 0-based
-    int repeat = 1;
+    int repeat = REPEAT_MODE_OFF;
     bool shuffle = false;
     Json::Value song;  // the current queue entry, null when none
     Json::Value status;

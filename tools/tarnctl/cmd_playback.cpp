@@ -155,7 +155,7 @@ int Step(const Command &c, Args &a, bool forward)
     Snapshot s;
     if (Settle(&s) != 0 || NeedQueue(s) != 0)
         return kExitFail;
-    bool wrap = s.repeat == 3;
+    bool wrap = s.repeat == REPEAT_MODE_ALL;
     if (forward && !wrap && s.orderIndex + 1 >= s.total)
         return Fail("song %d is the last of the queue (repeat is off)", s.current + 1);
     if (!forward && !wrap && s.orderIndex == 0)
@@ -345,7 +345,10 @@ int CmdRepeat(const Command &c, Args &a)
     if (GetSnapshot(&s, false) != 0)
         return kExitFail;
     if (!a.empty()) {
-        int mode = a[0] == "off" ? 1 : a[0] == "one" ? 2 : a[0] == "all" ? 3 : 0;
+        int mode = a[0] == "off"   ? REPEAT_MODE_OFF
+                   : a[0] == "one" ? REPEAT_MODE_ONE
+                   : a[0] == "all" ? REPEAT_MODE_ALL
+                                   : REPEAT_MODE_NONE;
         if (!mode)
             return UsageError(c, "'%s': say off, one or all", a[0].c_str());
         if (mode != s.repeat) {

@@ -131,7 +131,9 @@ std::string WatchLine(const Seen &s, const PublishedStatusShm *seg, int total, i
     std::string times = state == kStopped ? "" : ClockText(p.position) + "/" + ClockText(p.duration) + " ";
     std::string where = total > 0 && !s.uri.empty() ? "#" + std::to_string(p.index + 1) + "/" + std::to_string(total) + " " : "";
     std::string flags = std::string("vol ") + std::to_string(p.volume) + "%" +
-                        (p.repeatMode == 2 ? " repeat-one" : p.repeatMode == 3 ? " repeat-all" : "") +
+                        (p.repeatMode == REPEAT_MODE_ONE   ? " repeat-one"
+                         : p.repeatMode == REPEAT_MODE_ALL ? " repeat-all"
+                                                           : "") +
                         (p.shuffle ? " shuffle" : "");
     std::string title = s.title.empty() ? s.uri : s.title;
     if (p.artist[0])

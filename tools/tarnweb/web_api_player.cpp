@@ -78,8 +78,8 @@ void WebRemote::RegisterTransportApi(httplib::Server &server)
             std::unique_ptr<Json::CharReader> r(rb.newCharReader());
             std::string text = hub->Current();
             r->parse(text.data(), text.data() + text.size(), &s, nullptr);
-            mode = s.get("repeat", 1).asInt() % 3 + 1;
-        } else if (!IntField(body, "mode", 1, 3, &mode)) {
+            mode = s.get("repeat", REPEAT_MODE_OFF).asInt() % REPEAT_MODE_ALL + 1;
+        } else if (!IntField(body, "mode", REPEAT_MODE_OFF, REPEAT_MODE_ALL, &mode)) {
             return Error(res, 400, "mode: 1 normal, 2 repeat one, 3 repeat all");
         }
         if (Send(res, ACT_SET_REPEAT_MODE, std::to_string(mode))) {

@@ -267,7 +267,8 @@ void StatusHub::Refresh(bool full)
     s["position"] = song ? now.position : 0;
     s["duration"] = song ? now.duration : 0;
     s["volume"] = now.volume;
-    s["repeat"] = now.repeatMode >= 1 && now.repeatMode <= 3 ? now.repeatMode : 1;
+    s["repeat"] = now.repeatMode >= REPEAT_MODE_OFF && now.repeatMode <= REPEAT_MODE_ALL ? now.repeatMode
+                                                                                : REPEAT_MODE_OFF;
     s["shuffle"] = now.shuffle != 0;
     s["index"] = song ? now.index : extra.get("current", 0).asInt();
     s["total"] = extra.get("total", 0).asInt();
