@@ -261,9 +261,15 @@ int CmdSeek(const Command &c, Args &a)
         return Fail("cannot seek: the length of this song is not known (a stream?)");
     if (Request(ACT_SEEK, std::to_string(target), nullptr, true) != 0)
         return kExitFail;
+    // Positions come in whole seconds; the one from before the seek counts
+    // only when it is the target itself (a short seek back must not be
+    // taken as done while the old position still shows).
     Snapshot after;
-    if (!WaitFor([&](const Snapshot &x) { return x.position >= target - 2 && x.position <= target + 3; }, 2000,
-                 &after))
+    auto arrived = [&](const Snapshot &x) {
+        bool near = x.position >= target - 1 && x.position <= target + 2;
+        return near && (x.position != s.position || x.position == target);
+    };
+    if (!WaitFor(arrived, 2000, &after))
         return Fail("the player did not seek (position %s, wanted %s)", ClockText(after.position).c_str(),
                     ClockText(target).c_str());
     return ShowAfter();
