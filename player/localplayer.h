@@ -90,6 +90,8 @@ private:
     // A player process started and not yet connected: a second start would
     // kill it half-way; the song asked for meanwhile is loaded once it
     // connects.
+    // Commands with a value travel in a fixed buffer of this size, NUL-padded.
+    static constexpr size_t kPaddedCommandSize = 2048;
     int64_t startedAtMs;     // 0: none waiting
     std::string pendingUri;
     bool StartPending();
