@@ -1,5 +1,7 @@
 #include "daemon/ctrl_conns.h"
 
+#include "platform/tarn_clock.h"
+
 #include <cerrno>
 #include <ctime>
 #include <sys/ioctl.h>
@@ -15,9 +17,7 @@ const int64_t kWaitMs = 500;
 
 int64_t NowMs()
 {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<int64_t>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+    return TarnNowMs();
 }
 
 ControlConnections::~ControlConnections()

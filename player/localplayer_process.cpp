@@ -13,6 +13,7 @@
 #include <unistd.h>
 
 #include "audio/info.h"
+#include "platform/tarn_clock.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_log.h"
 #include "platform/tlibc_proc.h"
@@ -30,13 +31,6 @@ const char kNeutralEqualizer[] = "0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0 0.0";
 const int64_t kConnectWaitMs = 10000;
 // How long it may take to write its pid file.
 const int64_t kPidFileWaitMs = 2000;
-
-int64_t MonotonicMs()
-{
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<int64_t>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
-}
 
 }  // namespace
 
@@ -192,7 +186,7 @@ int LocalPlayer::StartMplayer(const std::string &uri)
         startedAtMs = 0;
         return -1;
     }
-    startedAtMs = MonotonicMs();
+    startedAtMs = TarnNowMs();
     return 0;
 }
 
@@ -224,7 +218,7 @@ bool LocalPlayer::StartPending()
 {
     if (mplayerFd >= 0 || startedAtMs == 0)
         return false;
-    int64_t age = MonotonicMs() - startedAtMs;
+    int64_t age = TarnNowMs() - startedAtMs;
     // The process writes its pid file first thing; past the first moments
     // one that is not alive ended before it connected.
     return age < kConnectWaitMs && (age < kPidFileWaitMs || IsMplayerAlive());

@@ -6,6 +6,7 @@
 
 #include <time.h>
 
+#include "platform/tarn_clock.h"
 #include "wire/tarn_wire.h"
 
 namespace upnpplayer_internal {
@@ -36,13 +37,6 @@ enum {
 const int kTransitionNotAvailable = 701;
 const int kPlayRetries = 5;
 const long long kPlayRetryDelayMs = 250;
-
-inline long long MonotonicMs()
-{
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
-}
 
 inline const char *StateText(int s)
 {

@@ -52,7 +52,7 @@ void UpnpPlayer::FinishJob(RENDERER_INFO *r)
             // Still between two states (loading the song, say): Play is
             // sent again shortly.
             ++playRetries;
-            retryPlayAtMs = MonotonicMs() + kPlayRetryDelayMs;
+            retryPlayAtMs = TarnNowMs() + kPlayRetryDelayMs;
             retryKind = kind;
             jobUrl = url;
             break;
@@ -128,7 +128,7 @@ void UpnpPlayer::ExpectNextAfter(int position)
     nextTopRel = position;
     int now = EstimateRelTime(position);
     int left = renderer && renderer->duration > now ? renderer->duration - now : 0;
-    nextDueMs = MonotonicMs() + left * 1000LL + kMovedOnGraceMs;
+    nextDueMs = TarnNowMs() + left * 1000LL + kMovedOnGraceMs;
 }
 
 // True once the renderer plays the song handed ahead: it names it, and its
@@ -146,7 +146,7 @@ bool UpnpPlayer::MovedOnToNext(RENDERER_INFO *r)
     nextTopRel = std::max(nextTopRel, r->rel_time);
     if (!named)
         return false;
-    long long now = MonotonicMs();
+    long long now = TarnNowMs();
     if (state == PLAYER_STATE_PLAYING && now >= nextDueMs)
         return true;
     if (now - positionAskedMs >= kMovedOnAskMs) {
@@ -206,7 +206,7 @@ int UpnpPlayer::Poll()
         return -1;
     renderer = r;
 
-    if (retryPlayAtMs != 0 && jobKind == JOB_NONE && MonotonicMs() >= retryPlayAtMs) {
+    if (retryPlayAtMs != 0 && jobKind == JOB_NONE && TarnNowMs() >= retryPlayAtMs) {
         retryPlayAtMs = 0;
         std::vector<RendererAction> steps;
         steps.push_back(UpnpController::MakeAction("Play", {"InstanceID", "Speed"}, {"0", "1"}));

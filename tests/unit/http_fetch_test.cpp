@@ -10,14 +10,16 @@
 
 #include <httplib.h>
 
+#include "tests/unit/loopback_http.h"
+
 #include "platform/http_fetch.h"
 
 namespace {
 
 class HttpFetchTest : public ::testing::Test {
 protected:
-    httplib::Server server;
-    std::thread serverThread;
+    LoopbackHttp http;
+    httplib::Server &server = http.server;
     std::string base;
     std::string lastAgent;  // written by the server thread before it answers
 
@@ -41,19 +43,10 @@ protected:
             std::this_thread::sleep_for(std::chrono::milliseconds(2500));
             res.set_content("late", "text/plain");
         });
-        int port = server.bind_to_any_port("127.0.0.1");
-        ASSERT_GT(port, 0);
-        base = "http://127.0.0.1:" + std::to_string(port);
-        serverThread = std::thread([this] { server.listen_after_bind(); });
-        for (int i = 0; i < 200 && !server.is_running(); i++)
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        ASSERT_TRUE(server.is_running());
+        base = http.Start();
+        ASSERT_NE("", base) << "no server on 127.0.0.1";
     }
-    void TearDown() override
-    {
-        server.stop();
-        serverThread.join();
-    }
+    void TearDown() override { http.Stop(); }
     static HttpFetchOptions Options()
     {
         HttpFetchOptions o;

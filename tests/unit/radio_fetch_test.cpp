@@ -11,6 +11,8 @@
 #include <utime.h>
 
 #include <httplib.h>
+
+#include "tests/unit/loopback_http.h"
 #include <json/json.h>
 
 #include "daemon/tarn_types.h"
@@ -33,8 +35,8 @@ const char kGoodAnswer[] = R"([
 class RadioFetchTest : public ::testing::Test {
 protected:
     tarntest::Harness h;
-    httplib::Server server;
-    std::thread serverThread;
+    LoopbackHttp http;
+    httplib::Server &server = http.server;
     std::atomic<int> hits{0};
     std::string lastTarget;  // written by the server thread before hits grows
 
@@ -59,19 +61,11 @@ protected:
             else
                 res.status = 500;
         });
-        int port = server.bind_to_any_port("127.0.0.1");
-        ASSERT_GT(port, 0);
-        base = "http://127.0.0.1:" + std::to_string(port) + "/";
-        serverThread = std::thread([this] { server.listen_after_bind(); });
-        for (int i = 0; i < 200 && !server.is_running(); i++)
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        ASSERT_TRUE(server.is_running());
+        base = http.Start();
+        ASSERT_NE("", base) << "no server on 127.0.0.1";
+        base += "/";
     }
-    void TearDown() override
-    {
-        server.stop();
-        serverThread.join();
-    }
+    void TearDown() override { http.Stop(); }
     void UseDirectory(const std::string &url)
     {
         ASSERT_EQ(0, h.WriteFile(TARN_INFO_CONF, "radio_directory_url=" + url + "\nradio_directory_timeout=1\n"));
