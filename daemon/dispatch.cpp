@@ -12,8 +12,10 @@
 
 #include "daemon/globals.h"
 #include "daemon/socket.h"
+#include "platform/json_text.h"
 #include "platform/tarn_log.h"
 #include "player/localplayer.h"
+#include "player/playlist_page.h"
 #include "player/upnpplayer.h"
 #include "source/changesrc.h"
 #include "upnp/upnp.h"
@@ -109,55 +111,36 @@ void SelectPlayer(const char *parameter, UpnpController *controller,
 // ---------------------------------------------------------------------------
 // Control requests.
 
-namespace {
-
-// Text as it is (UTF-8 written raw, control characters escaped), indented
-// like the replies always were.
-std::string ReplyText(const Json::Value &reply)
-{
-    static Json::StreamWriterBuilder *builder = [] {
-        Json::StreamWriterBuilder *b = new Json::StreamWriterBuilder();
-        (*b)["indentation"] = "   ";
-        (*b)["emitUTF8"] = true;
-        return b;
-    }();
-    return Json::writeString(*builder, reply) + "\n";
-}
-
-}  // namespace
-
 // The reply with as many whole entries of its array `key` (a queue page's
-// "uris", a device list's "list") as fit CTRL_REPLY_SIZE - 1 characters. Each entry's share is estimated from its own text (its lines
-// sit two levels deeper in the reply); the result is checked and, in the rare
-// case the estimate was short, cut further.
+// "uris", a device list's "list") as fit CTRL_REPLY_SIZE - 1 characters:
+// the largest such count, found by halving.
 static std::string CutPage(const Json::Value &reply, const char *key)
 {
     Json::Value page = reply;
-    Json::Value &uris = page[key];
-    Json::Value all = uris;
-    uris = Json::Value(Json::arrayValue);
-    size_t used = ReplyText(page).size();
-    Json::ArrayIndex fit = 0;
-    for (; fit < all.size(); fit++) {
-        std::string item = ReplyText(all[fit]);
-        size_t lines = static_cast<size_t>(std::count(item.begin(), item.end(), '\n'));
-        used += item.size() + 6 * lines + 8;
-        if (used >= CTRL_REPLY_SIZE)
-            break;
-        uris.append(all[fit]);
+    Json::Value &entries = page[key];
+    const Json::Value all = entries;
+    Json::ArrayIndex fits = 0;            // known to fit
+    Json::ArrayIndex tooMany = all.size();  // known not to
+    std::string text;
+    while (tooMany - fits > 1) {
+        Json::ArrayIndex n = fits + (tooMany - fits) / 2;
+        entries = Json::Value(Json::arrayValue);
+        for (Json::ArrayIndex i = 0; i < n; i++)
+            entries.append(all[i]);
+        if (JsonText(page).size() < CTRL_REPLY_SIZE)
+            fits = n;
+        else
+            tooMany = n;
     }
-    std::string text = ReplyText(page);
-    while (text.size() >= CTRL_REPLY_SIZE && uris.size() > 0) {
-        Json::Value removed;
-        uris.removeIndex(uris.size() - 1, &removed);
-        text = ReplyText(page);
-    }
-    return text;
+    entries = Json::Value(Json::arrayValue);
+    for (Json::ArrayIndex i = 0; i < fits; i++)
+        entries.append(all[i]);
+    return JsonText(page);
 }
 
 void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE])
 {
-    std::string text = ReplyText(reply);
+    std::string text = JsonText(reply);
     // A queue page or device list that does not fit is cut by whole entries
     // from its end, so that the reply stays valid JSON; "total" still tells
     // the whole length.
@@ -303,19 +286,60 @@ void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPla
     player->HandleAction(request, reply);
 }
 
+namespace {
+
+// The selected player's queue, for a page written straight from it; null
+// when another path is to answer (nothing selected, or a selection whose
+// player is missing, which that path logs).
+Playlist *SelectedQueue(LocalPlayer *localPlayer, std::vector<UpnpPlayer *> &upnpPlayers)
+{
+    if (g_localSelected)
+        return localPlayer->GetPlaylist();
+    if (g_selectedRenderer == -1)
+        return nullptr;
+    UpnpPlayer *player = FindPlayerByIndex(upnpPlayers, g_selectedRenderer);
+    return player ? player->GetPlaylist() : nullptr;
+}
+
+}  // namespace
+
+void AnswerRequest(const ControlRequest *request, char out[CTRL_REPLY_SIZE], LocalPlayer *localPlayer,
+                   UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers)
+{
+    Playlist *queue = request->action == ACT_QUEUE_LIST ? SelectedQueue(localPlayer, upnpPlayers) : nullptr;
+    if (queue) {
+        // The text the page's JSON value would give, without building it.
+        std::string param(request->parameter, strnlen(request->parameter, sizeof(request->parameter)));
+        int start = 0;
+        int limit = 0;
+        sscanf(param.c_str(), "%d %d", &start, &limit);
+        std::string text;
+        // A renderer player's queue is read under the controller's lock.
+        if (controller)
+            controller->Lock();
+        PlaylistPageText(*queue, start, limit, CTRL_REPLY_SIZE - 1, &text);
+        if (controller)
+            controller->Unlock();
+        memset(out, 0, CTRL_REPLY_SIZE);
+        memcpy(out, text.data(), std::min(text.size(), static_cast<size_t>(CTRL_REPLY_SIZE - 1)));
+        return;
+    }
+    Json::Value reply;  // null unless a handler fills it
+    DispatchRequest(request, reply, localPlayer, controller, upnpPlayers);
+    FormatReply(reply, out);
+}
+
 int HandleRequest(int fd, LocalPlayer *localPlayer, UpnpController *controller,
                   std::vector<UpnpPlayer *> &upnpPlayers)
 {
-    Json::Value reply;  // null unless a handler fills it
     if (fd < 0)
         return -1;
     if (WaitFd(fd, false)) {
         GuardedRequest in;
         if (ReadRequest(fd, &in) == 0) {
-            DispatchRequest(&in.request, reply, localPlayer, controller, upnpPlayers);
+            char out[CTRL_REPLY_SIZE];
+            AnswerRequest(&in.request, out, localPlayer, controller, upnpPlayers);
             if (WaitFd(fd, true)) {
-                char out[CTRL_REPLY_SIZE];
-                FormatReply(reply, out);
                 ssize_t w = write(fd, out, sizeof(out));
                 (void)w;  // a client that went away is its own loss
             }
@@ -337,9 +361,7 @@ void ServeRequest(DaemonContext &ctx, int fd)
         ctx.conns.Close(fd);
         return;
     }
-    Json::Value reply;  // null unless a handler fills it
-    DispatchRequest(&in.request, reply, ctx.localPlayer, ctx.controller, ctx.upnpPlayers);
     char out[CTRL_REPLY_SIZE];
-    FormatReply(reply, out);
+    AnswerRequest(&in.request, out, ctx.localPlayer, ctx.controller, ctx.upnpPlayers);
     ctx.conns.Reply(fd, out, sizeof(out));
 }

@@ -83,8 +83,14 @@ void ServeRequest(DaemonContext &ctx, int fd);
 // The renderer player whose renderer has the index, or nullptr.
 UpnpPlayer *FindPlayerByIndex(std::vector<UpnpPlayer *> &players, int index);
 
-// The reply text as sent: the styled JSON text cut to 8191 characters and
+// The reply text as sent: the JSON text (platform/json_text.h) cut to 8191
+// characters by whole entries of a page or list, and
 // NUL-terminated in an 8192-byte buffer.
 void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE]);
+
+// The reply text of one request into out (dispatched, or for a queue page
+// written straight from the selected player's queue: the same text).
+void AnswerRequest(const ControlRequest *request, char out[CTRL_REPLY_SIZE], LocalPlayer *localPlayer,
+                   UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers);
 
 #endif

@@ -1,21 +1,18 @@
-// The play queue as clients see it: its JSON views and the queue actions of
-// control requests. The queue itself (player/playlist.h) knows neither.
+// The play queue as clients see it: its JSON views (a page of it in
+// player/playlist_page.h) and the queue actions of control requests. The
+// queue itself (player/playlist.h) knows neither.
 #ifndef TARN_PLAYLIST_ACTIONS_H
 #define TARN_PLAYLIST_ACTIONS_H
 
 #include <json/json.h>
 
 #include "player/playlist.h"
+#include "player/playlist_page.h"
 #include "wire/tarn_wire.h"
 
 // "title", "current", "artist" and "path" of the current entry into info;
 // -1 (logged) when the current index names no entry.
 int PlaylistCurrentInfoJson(const Playlist &playlist, Json::Value &info);
-
-// One page of the queue into reply: "uris" (at most 64 entries from start;
-// limit 0 or above 64 means 64, a negative limit 20), "total", "current",
-// "mode", "shuffle" and "order_index".
-int PlaylistListJson(const Playlist &playlist, int start, int limit, Json::Value &reply);
 
 // Carries out one queue action (ACT_QUEUE_*, ACT_SET_REPEAT_MODE,
 // ACT_TOGGLE_SHUFFLE, ACT_CYCLE_REPEAT_MODE); the list action answers in

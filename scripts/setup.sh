@@ -4,7 +4,7 @@
 set -e
 PKGS="build-essential cmake pkg-config git clang libclang-rt-14-dev
 libgtest-dev libgmock-dev
-libupnp-dev libjsoncpp-dev
+libupnp-dev libjsoncpp-dev rapidjson-dev
 libgstreamer1.0-dev libgstreamer-plugins-base1.0-dev gstreamer1.0-tools
 gstreamer1.0-plugins-base gstreamer1.0-plugins-good gstreamer1.0-plugins-ugly
 gstreamer1.0-libav gstreamer1.0-alsa

@@ -124,10 +124,10 @@ TEST_F(RequestsTest, QueueRecordsInsertPositionAndCutReplies)
     ControlRequest req = tarntest::MakeRequest(ACT_QUEUE_LIST, "0 10");
     ASSERT_EQ(0, h.SendBytes(&req, sizeof(req), &reply, 3000, &received));
     EXPECT_EQ(static_cast<size_t>(CTRL_REPLY_SIZE), received);
-    // Styled JSON: one member per line, ends with a line feed.
+    // Indented JSON: one member per line, ends with a line feed.
     EXPECT_EQ('{', reply[0]);
     EXPECT_EQ('\n', reply.back());
-    EXPECT_NE(std::string::npos, reply.find("\n   \"total\" : 3")) << reply;
+    EXPECT_NE(std::string::npos, reply.find("\n   \"total\": 3")) << reply;
     Json::Value v = Parse(reply);
     EXPECT_EQ("Ann", v["uris"][0]["artist"].asString());
     EXPECT_EQ("/music/b.mp3", v["uris"][1]["res"].asString());
