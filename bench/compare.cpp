@@ -643,20 +643,25 @@ void Pin(pid_t pid, int cpu)
     closedir(d);
 }
 
-// n fresh-connection status requests to each daemon, times in us.
+// n fresh-connection status requests to each daemon, times in us. The two
+// take turns in blocks, so that both meet the same placements of the client
+// on the CPUs (a placement tends to last, and decides a wake-up's cost).
 void MeasureRoundTrips(Ours &o, Mpd &m, int n, std::vector<double> *to, std::vector<double> *tm)
 {
-    for (int i = 0; i < n; ++i) {
-        auto t0 = Clock::now();
-        if (!o.Text(ACT_GET_STATUS, ""))
-            Die("tarnaudiod stopped answering during the round-trip run");
-        to->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
-    }
-    for (int i = 0; i < n; ++i) {
-        auto t0 = Clock::now();
-        if (!m.Fresh("status"))
-            Die("mpd stopped answering during the round-trip run");
-        tm->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    const int block = 250;
+    for (int done = 0; done < n; done += block) {
+        for (int i = done; i < n && i < done + block; ++i) {
+            auto t0 = Clock::now();
+            if (!o.Text(ACT_GET_STATUS, ""))
+                Die("tarnaudiod stopped answering during the round-trip run");
+            to->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+        }
+        for (int i = done; i < n && i < done + block; ++i) {
+            auto t0 = Clock::now();
+            if (!m.Fresh("status"))
+                Die("mpd stopped answering during the round-trip run");
+            tm->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+        }
     }
 }
 
