@@ -43,59 +43,121 @@ int PlaylistCurrentInfoJson(const Playlist &playlist, Json::Value &info)
     return 0;
 }
 
+namespace {
+
+// What a queue action gets: the request, its text bounded by the parameter
+// area, and the reply.
+typedef void (*QueueHandler)(Playlist &playlist, const ControlRequest *request,
+                             const std::string &text, Json::Value &reply);
+
+struct QueueAction {
+    int action;
+    QueueHandler handle;
+};
+
+// A song refused because the queue is full says so in the reply.
+void NoteFull(const Playlist &playlist, int rc, Json::Value &reply)
+{
+    if (rc != 0 && playlist.Count() >= PlaylistMaxSongs())
+        reply["error"] = "the queue is full: " + std::to_string(PlaylistMaxSongs()) + " songs (audio_queue_max)";
+}
+
+void QueueAdd(Playlist &playlist, const ControlRequest *request, const std::string &, Json::Value &reply)
+{
+    TARN_MEDIA_INFO info;
+    memcpy(&info, request->parameter, sizeof(info));
+    NoteFull(playlist, playlist.AddSong(&info), reply);
+}
+
+void QueueRemove(Playlist &playlist, const ControlRequest *, const std::string &text, Json::Value &)
+{
+    playlist.RemoveSong(static_cast<unsigned>(ParseDecimal(text)));
+}
+
+void QueueClear(Playlist &playlist, const ControlRequest *, const std::string &, Json::Value &)
+{
+    playlist.Clear();
+}
+
+void QueueInsert(Playlist &playlist, const ControlRequest *request, const std::string &, Json::Value &reply)
+{
+    TARN_MEDIA_INFO info;
+    memcpy(&info, request->parameter, sizeof(info));
+    int32_t index = 0;
+    memcpy(&index, reinterpret_cast<const char *>(request) + CTRL_INSERT_POS_OFFSET, sizeof(index));
+    NoteFull(playlist, playlist.InsertSong(static_cast<unsigned>(index), &info), reply);
+}
+
+void QueueSetCurrent(Playlist &playlist, const ControlRequest *, const std::string &text, Json::Value &)
+{
+    playlist.SetCurrent(static_cast<unsigned>(ParseDecimal(text)));
+}
+
+void QueueSetMode(Playlist &playlist, const ControlRequest *, const std::string &text, Json::Value &)
+{
+    playlist.SetMode(ParseDecimal(text));
+}
+
+void QueueShuffle(Playlist &playlist, const ControlRequest *, const std::string &, Json::Value &)
+{
+    playlist.ToggleShuffle();
+}
+
+void QueueList(Playlist &playlist, const ControlRequest *, const std::string &text, Json::Value &reply)
+{
+    int start = 0;
+    int limit = 0;
+    sscanf(text.c_str(), "%d %d", &start, &limit);
+    PlaylistListJson(playlist, start, limit, reply);
+}
+
+void QueueCycleMode(Playlist &playlist, const ControlRequest *, const std::string &, Json::Value &)
+{
+    playlist.ToggleRepeatMode();
+}
+
+// The queue's actions: the one list of them; both players hand these over.
+const QueueAction kQueueActions[] = {
+    {ACT_QUEUE_ADD, QueueAdd},
+    {ACT_QUEUE_REMOVE, QueueRemove},
+    {ACT_QUEUE_CLEAR, QueueClear},
+    {ACT_QUEUE_INSERT, QueueInsert},
+    {ACT_QUEUE_SET_CURRENT, QueueSetCurrent},
+    {ACT_SET_REPEAT_MODE, QueueSetMode},
+    {ACT_TOGGLE_SHUFFLE, QueueShuffle},
+    {ACT_QUEUE_LIST, QueueList},
+    {ACT_CYCLE_REPEAT_MODE, QueueCycleMode},
+};
+
+const QueueAction *FindQueueAction(int action)
+{
+    for (const QueueAction &q : kQueueActions) {
+        if (q.action == action)
+            return &q;
+    }
+    return nullptr;
+}
+
+}  // namespace
+
+bool PlaylistTakesAction(int action)
+{
+    return FindQueueAction(action) != nullptr;
+}
+
 int PlaylistHandleAction(Playlist &playlist, const ControlRequest *request, Json::Value &reply)
 {
     if (!request) {
         TLOG("Bad parameter");
         return -1;
     }
-    // The request text, bounded by the parameter area.
-    std::string text(request->parameter, strnlen(request->parameter, sizeof(request->parameter)));
-    switch (request->action) {
-    case ACT_QUEUE_ADD: {
-        TARN_MEDIA_INFO info;
-        memcpy(&info, request->parameter, sizeof(info));
-        if (playlist.AddSong(&info) != 0 && playlist.Count() >= PlaylistMaxSongs())
-            reply["error"] = "the queue is full: " + std::to_string(PlaylistMaxSongs()) + " songs (audio_queue_max)";
-        break;
-    }
-    case ACT_QUEUE_REMOVE:
-        playlist.RemoveSong(static_cast<unsigned>(ParseDecimal(text)));
-        break;
-    case ACT_QUEUE_CLEAR:
-        playlist.Clear();
-        break;
-    case ACT_QUEUE_INSERT: {
-        TARN_MEDIA_INFO info;
-        memcpy(&info, request->parameter, sizeof(info));
-        int32_t index = 0;
-        memcpy(&index, reinterpret_cast<const char *>(request) + CTRL_INSERT_POS_OFFSET, sizeof(index));
-        if (playlist.InsertSong(static_cast<unsigned>(index), &info) != 0 && playlist.Count() >= PlaylistMaxSongs())
-            reply["error"] = "the queue is full: " + std::to_string(PlaylistMaxSongs()) + " songs (audio_queue_max)";
-        break;
-    }
-    case ACT_QUEUE_SET_CURRENT:
-        playlist.SetCurrent(static_cast<unsigned>(ParseDecimal(text)));
-        break;
-    case ACT_SET_REPEAT_MODE:
-        playlist.SetMode(ParseDecimal(text));
-        break;
-    case ACT_TOGGLE_SHUFFLE:
-        playlist.ToggleShuffle();
-        break;
-    case ACT_QUEUE_LIST: {
-        int start = 0;
-        int limit = 0;
-        sscanf(text.c_str(), "%d %d", &start, &limit);
-        PlaylistListJson(playlist, start, limit, reply);
-        break;
-    }
-    case ACT_CYCLE_REPEAT_MODE:
-        playlist.ToggleRepeatMode();
-        break;
-    default:
+    const QueueAction *q = FindQueueAction(request->action);
+    if (!q) {
         TarnLog("%s:%d Action [%d] not handled", kLogUnit, 567, request->action);
         return -1;
     }
+    // The request text, bounded by the parameter area.
+    std::string text(request->parameter, strnlen(request->parameter, sizeof(request->parameter)));
+    q->handle(playlist, request, text, reply);
     return 0;
 }

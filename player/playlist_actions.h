@@ -14,10 +14,14 @@
 // -1 (logged) when the current index names no entry.
 int PlaylistCurrentInfoJson(const Playlist &playlist, Json::Value &info);
 
-// Carries out one queue action (ACT_QUEUE_*, ACT_SET_REPEAT_MODE,
-// ACT_TOGGLE_SHUFFLE, ACT_CYCLE_REPEAT_MODE); the list action answers in
-// reply, a refused song of a full queue sets reply["error"]. -1 for a null
-// request or an action that is not the queue's.
+// Whether action is one of the queue's (ACT_QUEUE_*, ACT_SET_REPEAT_MODE,
+// ACT_TOGGLE_SHUFFLE, ACT_CYCLE_REPEAT_MODE): the players hand these to
+// PlaylistHandleAction.
+bool PlaylistTakesAction(int action);
+
+// Carries out one queue action; the list action answers in reply, a refused
+// song of a full queue sets reply["error"]. -1 for a null request or an
+// action that is not the queue's.
 int PlaylistHandleAction(Playlist &playlist, const ControlRequest *request, Json::Value &reply);
 
 #endif
