@@ -72,6 +72,62 @@ LocalPlayer::~LocalPlayer()
     delete playlist;
 }
 
+namespace {
+
+// One action the local player takes itself. fresh: a play request, which
+// starts afresh (earlier errors are history). The action's own result does
+// not reach the client.
+struct LocalAction {
+    int action;
+    int (*handle)(LocalPlayer &player, const char *text, Json::Value &reply);
+    bool fresh;
+};
+
+int PlayPauseAction(LocalPlayer &p, const char *, Json::Value &) { return p.PlayPause(); }
+int StopAction(LocalPlayer &p, const char *, Json::Value &) { return p.Stop(); }
+int NextAction(LocalPlayer &p, const char *, Json::Value &) { return p.Next(false); }
+int PreviousAction(LocalPlayer &p, const char *, Json::Value &) { return p.Previous(); }
+int PlayIndexAction(LocalPlayer &p, const char *text, Json::Value &) { return p.PlayIndex(text); }
+int SeekAction(LocalPlayer &p, const char *text, Json::Value &) { return p.Seek(text); }
+int MuteAction(LocalPlayer &p, const char *, Json::Value &) { return p.Mute(); }
+int StatusAction(LocalPlayer &p, const char *, Json::Value &reply) { return p.GetStatusJson(reply); }
+int EqualizerAction(LocalPlayer &p, const char *text, Json::Value &) { return p.SetEqualizer(text); }
+int VolumeUpAction(LocalPlayer &p, const char *, Json::Value &) { return p.SetVolume(p.GetVolume() + 3); }
+int VolumeDownAction(LocalPlayer &p, const char *, Json::Value &) { return p.SetVolume(p.GetVolume() - 3); }
+
+int SetVolumeAction(LocalPlayer &p, const char *text, Json::Value &)
+{
+    return p.SetVolume(static_cast<int>(strtol(text, nullptr, 10)));
+}
+
+// The local player's own actions; the queue's (PlaylistTakesAction) go to
+// the queue.
+const LocalAction kLocalActions[] = {
+    {ACT_PLAY_PAUSE, PlayPauseAction, true},
+    {ACT_STOP, StopAction, false},
+    {ACT_NEXT, NextAction, true},
+    {ACT_PREVIOUS, PreviousAction, true},
+    {ACT_PLAY_INDEX, PlayIndexAction, true},
+    {ACT_SEEK, SeekAction, false},
+    {ACT_MUTE, MuteAction, false},
+    {ACT_SET_VOLUME, SetVolumeAction, false},
+    {ACT_VOLUME_UP, VolumeUpAction, false},
+    {ACT_VOLUME_DOWN, VolumeDownAction, false},
+    {ACT_GET_STATUS, StatusAction, false},
+    {ACT_SET_EQUALIZER, EqualizerAction, false},
+};
+
+const LocalAction *FindLocalAction(int action)
+{
+    for (const LocalAction &a : kLocalActions) {
+        if (a.action == action)
+            return &a;
+    }
+    return nullptr;
+}
+
+}  // namespace
+
 int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
 {
     if (!request) {
@@ -84,72 +140,21 @@ int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     memcpy(text, request->parameter, CTRL_PARAM_SIZE);
     text[CTRL_PARAM_SIZE] = '\0';
 
-    switch (request->action) {
-    case ACT_PLAY_PAUSE:
-    case ACT_PLAY_INDEX:
-    case ACT_NEXT:
-    case ACT_PREVIOUS:
-        // A play request starts afresh: earlier errors are history.
-        lastError.clear();
-        failedInARow = 0;
-        break;
-    default:
-        break;
+    const LocalAction *own = FindLocalAction(request->action);
+    if (own) {
+        if (own->fresh) {
+            lastError.clear();
+            failedInARow = 0;
+        }
+        own->handle(*this, text, reply);
+        return 0;
     }
-
-    switch (request->action) {
-    case ACT_PLAY_PAUSE:
-        PlayPause();
-        break;
-    case ACT_STOP:
-        Stop();
-        break;
-    case ACT_NEXT:
-        Next(false);
-        break;
-    case ACT_PREVIOUS:
-        Previous();
-        break;
-    case ACT_PLAY_INDEX:
-        PlayIndex(text);
-        break;
-    case ACT_SEEK:
-        Seek(text);
-        break;
-    case ACT_MUTE:
-        Mute();
-        break;
-    case ACT_SET_VOLUME:
-        SetVolume(static_cast<int>(strtol(text, nullptr, 10)));
-        break;
-    case ACT_VOLUME_UP:
-        SetVolume(volume + 3);
-        break;
-    case ACT_VOLUME_DOWN:
-        SetVolume(volume - 3);
-        break;
-    case ACT_GET_STATUS:
-        GetStatusJson(reply);
-        break;
-    case ACT_QUEUE_ADD:
-    case ACT_QUEUE_REMOVE:
-    case ACT_QUEUE_CLEAR:
-    case ACT_QUEUE_INSERT:
-    case ACT_QUEUE_SET_CURRENT:
-    case ACT_SET_REPEAT_MODE:
-    case ACT_TOGGLE_SHUFFLE:
-    case ACT_QUEUE_LIST:
-    case ACT_CYCLE_REPEAT_MODE:
+    if (PlaylistTakesAction(request->action)) {
         PlaylistHandleAction(*playlist, request, reply);
-        break;
-    case ACT_SET_EQUALIZER:
-        SetEqualizer(text);
-        break;
-    default:
-        TarnLog("%s:%d Action [%d] not handled", kLogUnit, 576, request->action);
-        return -1;
+        return 0;
     }
-    return 0;
+    TarnLog("%s:%d Action [%d] not handled", kLogUnit, 576, request->action);
+    return -1;
 }
 
 // ---------------------------------------------------------------------------
