@@ -383,6 +383,69 @@ void UpnpPlayer::ChangeVolume(int code, const char *text)
     controller->SetVolume(static_cast<int>(std::max<long long>(INT_MIN, std::min<long long>(INT_MAX, v))));
 }
 
+// The handlers of the renderer player's own actions. Each returns what the
+// client's request returns: 0 whatever the action did, or the status's own
+// result.
+struct UpnpPlayerActions {
+    static int PlayPause(UpnpPlayer &p, int, const char *, Json::Value &) { p.PlayPause(); return 0; }
+    static int Stop(UpnpPlayer &p, int, const char *, Json::Value &) { p.Stop(); return 0; }
+    static int Next(UpnpPlayer &p, int, const char *, Json::Value &) { p.Next(false); return 0; }
+    static int Previous(UpnpPlayer &p, int, const char *, Json::Value &) { p.Previous(false); return 0; }
+    static int PlayIndex(UpnpPlayer &p, int, const char *text, Json::Value &) { p.PlayIndex(text); return 0; }
+    static int Seek(UpnpPlayer &p, int, const char *text, Json::Value &) { p.Seek(text); return 0; }
+    static int Status(UpnpPlayer &p, int, const char *, Json::Value &reply) { return p.GetStatusJson(reply); }
+
+    static int Mute(UpnpPlayer &p, int, const char *, Json::Value &)
+    {
+        p.controller->SetMute(!p.mute);
+        return 0;
+    }
+
+    static int Volume(UpnpPlayer &p, int code, const char *text, Json::Value &)
+    {
+        p.ChangeVolume(code, text);
+        return 0;
+    }
+};
+
+namespace {
+
+struct RendererPlayerAction {
+    int action;
+    int (*handle)(UpnpPlayer &p, int code, const char *text, Json::Value &reply);  // nullptr: refused
+};
+
+// The renderer player's own actions; the queue's (PlaylistTakesAction) go to
+// the queue.
+const RendererPlayerAction kRendererPlayerActions[] = {
+    {ACT_PLAY_PAUSE, UpnpPlayerActions::PlayPause},
+    {ACT_STOP, UpnpPlayerActions::Stop},
+    {ACT_NEXT, UpnpPlayerActions::Next},
+    {ACT_PREVIOUS, UpnpPlayerActions::Previous},
+    {ACT_PLAY_INDEX, UpnpPlayerActions::PlayIndex},
+    {ACT_SEEK, UpnpPlayerActions::Seek},
+    {ACT_MUTE, UpnpPlayerActions::Mute},
+    {ACT_SET_VOLUME, UpnpPlayerActions::Volume},
+    {ACT_VOLUME_UP, UpnpPlayerActions::Volume},
+    {ACT_VOLUME_DOWN, UpnpPlayerActions::Volume},
+    {ACT_GET_STATUS, UpnpPlayerActions::Status},
+    // One of the queue's actions, refused here: the renderer player does
+    // not cycle the repeat mode (nor does it set the equalizer, which is in
+    // no table of its).
+    {ACT_CYCLE_REPEAT_MODE, nullptr},
+};
+
+const RendererPlayerAction *FindRendererPlayerAction(int action)
+{
+    for (const RendererPlayerAction &a : kRendererPlayerActions) {
+        if (a.action == action)
+            return &a;
+    }
+    return nullptr;
+}
+
+}  // namespace
+
 int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
 {
     if (!request) {
@@ -404,55 +467,18 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
         renderer = r;
     else
         renderer = nullptr;
-    switch (code) {
-    case ACT_PLAY_PAUSE:
-        PlayPause();
-        break;
-    case ACT_STOP:
-        Stop();
-        break;
-    case ACT_NEXT:
-        Next(false);
-        break;
-    case ACT_PREVIOUS:
-        Previous(false);
-        break;
-    case ACT_PLAY_INDEX:
-        PlayIndex(text);
-        break;
-    case ACT_SEEK:
-        Seek(text);
-        break;
-    case ACT_MUTE:
-        controller->SetMute(!mute);
-        break;
-    case ACT_SET_VOLUME:
-    case ACT_VOLUME_UP:
-    case ACT_VOLUME_DOWN:
-        ChangeVolume(code, text);
-        break;
-    case ACT_GET_STATUS:
-        result = GetStatusJson(reply);
-        break;
-    case ACT_QUEUE_ADD:
-    case ACT_QUEUE_REMOVE:
-    case ACT_QUEUE_CLEAR:
-    case ACT_QUEUE_INSERT:
-    case ACT_QUEUE_SET_CURRENT:
-    case ACT_SET_REPEAT_MODE:
-    case ACT_TOGGLE_SHUFFLE:
-    case ACT_QUEUE_LIST:
+    const RendererPlayerAction *own = FindRendererPlayerAction(code);
+    if (own && own->handle) {
+        result = own->handle(*this, code, text, reply);
+    } else if (!own && PlaylistTakesAction(code)) {
         PlaylistHandleAction(*playlist, request, reply);
         // The song handed ahead may no longer be the one that follows.
         if (code != ACT_QUEUE_LIST)
             nextDirty = true;
-        break;
-    default:
+    } else {
         TarnLog("%s:%d Action [%d] not handled", kLogUnit, 739, code);
         result = -1;
-        break;
     }
     controller->Unlock();
     return result;
 }
-

@@ -47,6 +47,9 @@ public:
     int GetState() const { return state; }
 
 private:
+    // The table of the actions HandleAction dispatches (upnpplayer.cpp).
+    friend struct UpnpPlayerActions;
+
     int PlayPause();
     int Stop();
     int Next(bool automatic);
