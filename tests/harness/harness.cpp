@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <fstream>
 #include <fcntl.h>
+#include <poll.h>
 #include <spawn.h>
 #include <sys/ipc.h>
 #include <sys/prctl.h>
@@ -16,7 +17,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include "daemon/ctrl.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_shm.h"
 #include "platform/tlibc_proc.h"
@@ -41,6 +41,26 @@ long NowMs()
 }
 
 void SleepMs(int ms) { usleep(static_cast<useconds_t>(ms) * 1000); }
+
+// Appends what comes on fd to *text until every writer closed it, an error,
+// or timeoutMs pass.
+void ReadUntilClosed(int fd, int timeoutMs, std::string *text)
+{
+    long end = NowMs() + timeoutMs;
+    for (long left = timeoutMs; left > 0; left = end - NowMs()) {
+        struct pollfd p = {fd, POLLIN, 0};
+        int r = poll(&p, 1, static_cast<int>(left));
+        if (r < 0 && errno == EINTR)
+            continue;
+        if (r <= 0)
+            break;
+        char buf[8192];
+        ssize_t n = read(fd, buf, sizeof(buf));
+        if (n <= 0)
+            break;
+        text->append(buf, static_cast<size_t>(n));
+    }
+}
 
 // Empties a directory tree (the directory itself stays).
 void EmptyDir(const std::string &dir)
@@ -307,7 +327,7 @@ int Harness::Run(const std::vector<std::string> &argv, std::string *out, int tim
     long end = NowMs() + timeoutMs;
     // Until every holder of the pipe closed it (a daemonizing child lets go).
     std::string text;
-    CtrlReadUntilClosed(fds[0], timeoutMs, &text);
+    ReadUntilClosed(fds[0], timeoutMs, &text);
     close(fds[0]);
     if (out)
         *out = text;
@@ -322,38 +342,6 @@ int Harness::Run(const std::vector<std::string> &argv, std::string *out, int tim
 }
 
 int Harness::PidFromFile() const { return TLIBCReadPidFile(Path(TARN_PID_FILE).c_str()); }
-
-int Harness::Start(int timeoutMs)
-{
-    if (!error.empty() && error.find("TARN_ROOT") != std::string::npos)
-        return -1;
-    if (daemonPid > 0)
-        return error = "daemon already started by this harness", -1;
-    long end = NowMs() + timeoutMs;
-    std::string out;
-    int rc = Launch(&out, timeoutMs);
-    if (rc != 0) {
-        error = "tarnaudiod exited with " + std::to_string(rc) + ": " + out + " " + error;
-        return -1;
-    }
-    for (;;) {
-        int pid = PidFromFile();
-        // Ready once it answers: the socket exists before the loop runs.
-        if (pid > 0 && TLIBCProcAlive(pid) && Exists(TARN_CTRL_SOCKET) &&
-            Request(ACT_GET_STATUS, nullptr, nullptr, static_cast<int>(end - NowMs())) == 0) {
-            daemonPid = pid;
-            error.clear();
-            return 0;
-        }
-        Reap();
-        if (NowMs() >= end) {
-            error = "tarnaudiod did not become ready (pid file " + std::to_string(pid) +
-                    "); log:\n" + Log();
-            return -1;
-        }
-        SleepMs(5);
-    }
-}
 
 int Harness::Stop(int timeoutMs)
 {
@@ -371,54 +359,6 @@ int Harness::Stop(int timeoutMs)
         return -1;
     }
     return rc;
-}
-
-// ---- control requests --------------------------------------------------------
-
-int Harness::Connect() const
-{
-    int fd = CtrlConnectAt(Path(TARN_CTRL_SOCKET).c_str(), false, nullptr);
-    return fd < 0 ? -1 : fd;
-}
-
-int Harness::SendBytes(const void *bytes, size_t length, std::string *reply, int timeoutMs,
-                       size_t *received)
-{
-    if (received)
-        *received = 0;
-    if (reply)
-        reply->clear();
-    int fd = Connect();
-    if (fd < 0) {
-        error = "cannot connect to " + Path(TARN_CTRL_SOCKET) + ": " + strerror(errno);
-        return -1;
-    }
-    if (length > 0 && write(fd, bytes, length) != static_cast<ssize_t>(length)) {
-        error = std::string("write failed: ") + strerror(errno);
-        close(fd);
-        return -1;
-    }
-    std::string data;
-    CtrlReadUntilClosed(fd, timeoutMs, &data);
-    close(fd);
-    if (received)
-        *received = data.size();
-    if (data.empty()) {
-        error = "no reply";
-        return -1;
-    }
-    if (reply)
-        *reply = std::string(data.c_str());
-    return 0;
-}
-
-int Harness::QueueInsert(const TARN_MEDIA_INFO &info, int position)
-{
-    ControlRequest req = MakeRequest(position < 0 ? ACT_QUEUE_ADD : ACT_QUEUE_INSERT);
-    memcpy(req.parameter, &info, sizeof(info));
-    int32_t pos = position < 0 ? 0 : position;
-    memcpy(reinterpret_cast<char *>(&req) + CTRL_INSERT_POS_OFFSET, &pos, sizeof(pos));
-    return RequestRaw(req, nullptr);
 }
 
 // ---- log ---------------------------------------------------------------------

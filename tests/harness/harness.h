@@ -8,6 +8,9 @@
 // child subreaper (the daemonized tarnaudiod is
 // reaped here) and ignores SIGPIPE. Nothing is started outside a private
 // network namespace (scripts/netns-run). Only one Harness at a time.
+// The calls that speak to the control socket (Start, the requests, Connect,
+// QueueAdd/QueueInsert) are in harness_ctrl.cpp and come with the
+// tarn_testharness library; the rest needs only tarn_testroot.
 #ifndef TARN_TEST_HARNESS_H
 #define TARN_TEST_HARNESS_H
 
