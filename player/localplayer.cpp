@@ -74,9 +74,8 @@ LocalPlayer::~LocalPlayer()
 
 namespace {
 
-// One action the local player takes itself. fresh: a play request, which
-// starts afresh (earlier errors are history). The action's own result does
-// not reach the client.
+// One action the local player takes itself; fresh: a play request. The
+// action's own result does not reach the client.
 struct LocalAction {
     int action;
     int (*handle)(LocalPlayer &player, const char *text, Json::Value &reply);
@@ -143,6 +142,7 @@ int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     const LocalAction *own = FindLocalAction(request->action);
     if (own) {
         if (own->fresh) {
+            // A play request starts afresh: earlier errors are history.
             lastError.clear();
             failedInARow = 0;
         }
