@@ -1,8 +1,6 @@
 // The queue's JSON views and its control-request actions.
 #include "player/playlist_actions.h"
 
-#include <algorithm>
-#include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
