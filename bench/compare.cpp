@@ -35,6 +35,7 @@
 #include <vector>
 #include <dirent.h>
 
+#include "platform/fd_read.h"
 #include "daemon/ctrl.h"
 #include "daemon/tarn_types.h"
 #include "platform/tarn_shm.h"
@@ -233,7 +234,7 @@ struct Ours {
         }
         std::string data;
         // Done with the whole reply, as the other daemon's is done at "OK".
-        CtrlReadUntilClosed(fd, 5000, &data, CTRL_REPLY_SIZE);
+        TarnReadUntilClosed(fd, 5000, &data, CTRL_REPLY_SIZE);
         close(fd);
         if (data.empty())
             return false;
@@ -1062,15 +1063,10 @@ int main(int argc, char **argv)
         if (strcmp(argv[i], "--quick") == 0) {
             g_quick = true;
         } else if (strcmp(argv[i], "--only") == 0 && i + 1 < argc) {
-            std::string list = argv[++i];
-            for (size_t at = 0; at <= list.size();) {
-                size_t comma = list.find(',', at);
-                if (comma == std::string::npos)
-                    comma = list.size();
-                if (comma > at)
-                    g_only.push_back(list.substr(at, comma - at));
-                at = comma + 1;
-            }
+            std::istringstream list(argv[++i]);
+            for (std::string section; std::getline(list, section, ',');)
+                if (!section.empty())
+                    g_only.push_back(section);
         } else {
             fprintf(stderr, "usage: %s [--quick] [--only SECTION[,SECTION...]]\n"
                             "sections: %s\n", argv[0], kSections);

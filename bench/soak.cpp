@@ -55,6 +55,7 @@
 
 #include <json/json.h>
 
+#include "platform/fd_read.h"
 #include "daemon/ctrl.h"
 #include "daemon/tarn_types.h"
 #include "tests/harness/harness.h"
@@ -149,7 +150,7 @@ int ValidRequest(const ControlRequest &req, std::string *reply, long deadlineMs)
     // Generous: hostile clients hold the daemon up to 0.5 s each, and a
     // client may wait behind several of them.
     std::string data;
-    CtrlReadUntilClosed(fd, 60000, &data);
+    TarnReadUntilClosed(fd, 60000, &data);
     close(fd);
     long ms = NowMs() - t0;
     if (data.size() != CTRL_REPLY_SIZE || data.find('\0') == std::string::npos) {
@@ -194,7 +195,7 @@ void Hostile(int kind, std::mt19937 &rng)
         if (write(fd, &req, sizeof(req)) < 0) {
         }
         std::string data;
-        CtrlReadUntilClosed(fd, 3000, &data);
+        TarnReadUntilClosed(fd, 3000, &data);
         break;
     }
     }

@@ -20,11 +20,6 @@ int CtrlConnect();
 // blocking either way.
 int CtrlConnectAt(const char *path, bool nonBlocking, int *error);
 
-// Appends what comes on fd to *data until the peer closes it, an error, or
-// timeoutMs pass (interrupted waits go on), or, with atMost > 0, once *data
-// holds atMost bytes; returns the size of *data.
-size_t CtrlReadUntilClosed(int fd, int timeoutMs, std::string *data, size_t atMost = 0);
-
 // Sends the 8196-byte request in one write and reads the first chunk of the
 // reply (waiting at most 0.5 s) into reply[0..replySize). 0 or -1.
 int CtrlSendRequest(const ControlRequest *request, char *reply, int replySize);

@@ -19,6 +19,7 @@
 #include "player/upnpplayer.h"
 #include "source/changesrc.h"
 #include "upnp/upnp.h"
+#include "wire/action_table.h"
 
 static const char kLogUnit[] = "tarnaudiod";
 
@@ -242,21 +243,12 @@ const DaemonAction kDaemonActions[] = {
     {ACT_SAVE_CUSTOM, nullptr, SaveCustom},
 };
 
-const DaemonAction *FindDaemonAction(int action)
-{
-    for (const DaemonAction &d : kDaemonActions) {
-        if (d.action == action)
-            return &d;
-    }
-    return nullptr;
-}
-
 }  // namespace
 
 void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
                      UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers)
 {
-    const DaemonAction *own = FindDaemonAction(request->action);
+    const DaemonAction *own = FindAction(kDaemonActions, request->action);
     if (own && own->change) {
         // A source change always returns playback to the local player,
         // before the change is even attempted.

@@ -21,6 +21,7 @@
 #include "platform/tarn_log.h"
 #include "platform/tlibc_proc.h"
 #include "player/playlist_actions.h"
+#include "wire/action_table.h"
 
 static const char kLogUnit[] = "localplayer";
 
@@ -116,15 +117,6 @@ const LocalAction kLocalActions[] = {
     {ACT_SET_EQUALIZER, EqualizerAction, false},
 };
 
-const LocalAction *FindLocalAction(int action)
-{
-    for (const LocalAction &a : kLocalActions) {
-        if (a.action == action)
-            return &a;
-    }
-    return nullptr;
-}
-
 }  // namespace
 
 int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
@@ -139,7 +131,7 @@ int LocalPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
     memcpy(text, request->parameter, CTRL_PARAM_SIZE);
     text[CTRL_PARAM_SIZE] = '\0';
 
-    const LocalAction *own = FindLocalAction(request->action);
+    const LocalAction *own = FindAction(kLocalActions, request->action);
     if (own) {
         if (own->fresh) {
             // A play request starts afresh: earlier errors are history.

@@ -7,6 +7,7 @@
 #include <string>
 
 #include "platform/tarn_log.h"
+#include "wire/action_table.h"
 
 static const char kLogUnit[] = "playlist";
 
@@ -127,20 +128,11 @@ const QueueAction kQueueActions[] = {
     {ACT_CYCLE_REPEAT_MODE, QueueCycleMode},
 };
 
-const QueueAction *FindQueueAction(int action)
-{
-    for (const QueueAction &q : kQueueActions) {
-        if (q.action == action)
-            return &q;
-    }
-    return nullptr;
-}
-
 }  // namespace
 
 bool PlaylistTakesAction(int action)
 {
-    return FindQueueAction(action) != nullptr;
+    return FindAction(kQueueActions, action) != nullptr;
 }
 
 int PlaylistHandleAction(Playlist &playlist, const ControlRequest *request, Json::Value &reply)
@@ -149,7 +141,7 @@ int PlaylistHandleAction(Playlist &playlist, const ControlRequest *request, Json
         TLOG("Bad parameter");
         return -1;
     }
-    const QueueAction *q = FindQueueAction(request->action);
+    const QueueAction *q = FindAction(kQueueActions, request->action);
     if (!q) {
         TarnLog("%s:%d Action [%d] not handled", kLogUnit, 567, request->action);
         return -1;

@@ -20,6 +20,7 @@
 #include "player/upnpplayer_internal.h"
 #include "upnp/upnp.h"
 #include "upnp/xml_util.h"
+#include "wire/action_table.h"
 
 static const char kLogUnit[] = "upnpplayer";
 
@@ -435,15 +436,6 @@ const RendererPlayerAction kRendererPlayerActions[] = {
     {ACT_CYCLE_REPEAT_MODE, nullptr},
 };
 
-const RendererPlayerAction *FindRendererPlayerAction(int action)
-{
-    for (const RendererPlayerAction &a : kRendererPlayerActions) {
-        if (a.action == action)
-            return &a;
-    }
-    return nullptr;
-}
-
 }  // namespace
 
 int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
@@ -467,7 +459,7 @@ int UpnpPlayer::HandleAction(const ControlRequest *request, Json::Value &reply)
         renderer = r;
     else
         renderer = nullptr;
-    const RendererPlayerAction *own = FindRendererPlayerAction(code);
+    const RendererPlayerAction *own = FindAction(kRendererPlayerActions, code);
     if (own && own->handle) {
         result = own->handle(*this, code, text, reply);
     } else if (!own && PlaylistTakesAction(code)) {

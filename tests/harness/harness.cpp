@@ -17,6 +17,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "platform/fd_read.h"
 #include "platform/tarn_env.h"
 #include "platform/tarn_shm.h"
 #include "platform/tlibc_proc.h"
@@ -41,26 +42,6 @@ long NowMs()
 }
 
 void SleepMs(int ms) { usleep(static_cast<useconds_t>(ms) * 1000); }
-
-// Appends what comes on fd to *text until every writer closed it, an error,
-// or timeoutMs pass.
-void ReadUntilClosed(int fd, int timeoutMs, std::string *text)
-{
-    long end = NowMs() + timeoutMs;
-    for (long left = timeoutMs; left > 0; left = end - NowMs()) {
-        struct pollfd p = {fd, POLLIN, 0};
-        int r = poll(&p, 1, static_cast<int>(left));
-        if (r < 0 && errno == EINTR)
-            continue;
-        if (r <= 0)
-            break;
-        char buf[8192];
-        ssize_t n = read(fd, buf, sizeof(buf));
-        if (n <= 0)
-            break;
-        text->append(buf, static_cast<size_t>(n));
-    }
-}
 
 // Empties a directory tree (the directory itself stays).
 void EmptyDir(const std::string &dir)
@@ -327,7 +308,7 @@ int Harness::Run(const std::vector<std::string> &argv, std::string *out, int tim
     long end = NowMs() + timeoutMs;
     // Until every holder of the pipe closed it (a daemonizing child lets go).
     std::string text;
-    ReadUntilClosed(fds[0], timeoutMs, &text);
+    TarnReadUntilClosed(fds[0], timeoutMs, &text);
     close(fds[0]);
     if (out)
         *out = text;

@@ -1,6 +1,7 @@
 // The harness's control-socket side: starting the daemon (ready once it
 // answers), raw requests and queue additions. Built into tarn_testharness
 // with the control-socket client; the rest of the harness needs neither.
+#include "platform/fd_read.h"
 #include "tests/harness/harness.h"
 
 #include <cerrno>
@@ -71,7 +72,7 @@ int Harness::SendBytes(const void *bytes, size_t length, std::string *reply, int
         return -1;
     }
     std::string data;
-    CtrlReadUntilClosed(fd, timeoutMs, &data);
+    TarnReadUntilClosed(fd, timeoutMs, &data);
     close(fd);
     if (received)
         *received = data.size();

@@ -12,6 +12,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "platform/fd_read.h"
 #include "daemon/ctrl.h"
 #include "daemon/ctrl_conns.h"
 #include "daemon/socket.h"
@@ -172,7 +173,7 @@ TEST(Socket, HeldConnectionsCloseTheSilentAndKeepADeliveredRequest)
     conns.Reply(fd, reply, sizeof(reply));
     EXPECT_EQ(0u, conns.Count());
     std::string text;
-    EXPECT_EQ(static_cast<size_t>(CTRL_REPLY_SIZE), CtrlReadUntilClosed(sender, 1000, &text));
+    EXPECT_EQ(static_cast<size_t>(CTRL_REPLY_SIZE), TarnReadUntilClosed(sender, 1000, &text));
     char byte;
     EXPECT_EQ(0, read(silent, &byte, 1)) << "the silent client was closed";
     close(silent);
