@@ -151,9 +151,14 @@ TEST_P(RendererDevices, FoundAtStartPlaysEverySongNeverHoldsTheDaemonAndKeepsIts
     printf("[ %s ] song to song %.2f s and %.2f s (songs of %d s)\n", Kind().c_str(), switches[0], switches[1],
            kSongSeconds);
     // No pause between songs: the song after one the renderer moved on to by
-    // itself is handed ahead too (its end not left to the slow check).
+    // itself is handed ahead too (its end not left to the slow check, which
+    // costs seconds). The renderer names a song handed ahead up to 2 s
+    // before it plays it, so one switch may look short and the next long:
+    // their sum is what shows a pause.
+    double total = 0;
     for (double s : switches)
-        EXPECT_LT(s, kSongSeconds + 1.0) << "a pause between two songs";
+        total += s;
+    EXPECT_LT(total, switches.size() * kSongSeconds + 1.0) << "a pause between two songs";
     // The access log has its line once the song's download ended.
     WAIT(v["TransportState"] == "STOPPED", (kSongSeconds + 8) * 1000);
     EXPECT_NE(std::string::npos, h.ReadFile("/tmp/tarnweb-access.log").find(tokens[2]))
