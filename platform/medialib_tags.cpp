@@ -20,8 +20,6 @@
 namespace fs = std::filesystem;
 using namespace medialib_internal;
 
-static const char kLogUnit[] = "medialib";
-
 // TagLib drops text fields that are not valid UTF-8 without telling, so the
 // raw tag blocks of the two common UTF-8 tag kinds are checked here: the
 // Vorbis comment of FLAC files and the UTF-8 text frames of ID3v2 tags.

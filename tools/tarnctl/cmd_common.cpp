@@ -181,7 +181,7 @@ std::string Field(const Snapshot &s, const std::string &name, bool *known)
     return std::string();
 }
 
-const char kFormatFields[] =
+extern const char kFormatFields[] =
     "%title% %artist% %album% %file% %position% %length% %time% %elapsed% %percent% %state% "
     "%volume% %repeat% %shuffle% %mute% %error%";
 

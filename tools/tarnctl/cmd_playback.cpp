@@ -415,7 +415,7 @@ int WithFormat(const Command &c, Args &a, bool currentOnly)
     if (hasFormat) {
         std::string out, bad;
         if (Expand(s, fmt, &out, &bad) != 0)
-            return UsageError(c, "unknown field %s in the format", bad.c_str());
+            return UsageError(c, "%s", ("unknown field " + bad + " in the format; fields: " + kFormatFields).c_str());
         if (!currentOnly || s.state != kStopped)
             printf("%s\n", out.c_str());
         return 0;

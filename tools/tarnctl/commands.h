@@ -45,6 +45,9 @@ int TerminalColumns();
 // A local file that is gone: why, else "".
 std::string MissingFile(const std::string &uri);
 std::string Field(const Snapshot &s, const std::string &name, bool *known);
+// The fields a --format text may name.
+extern const char kFormatFields[];
+
 // Expands a --format text; -1 with *bad set for an unknown field.
 int Expand(const Snapshot &s, const std::string &fmt, std::string *out, std::string *bad);
 void PrintStatus(const Snapshot &s);

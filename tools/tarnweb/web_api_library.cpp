@@ -16,8 +16,6 @@
 #include "tools/tarnweb/web_remote.h"
 #include "tools/tarnweb/web_api_util.h"
 
-static const char kLogUnit[] = "tarnweb";
-
 using namespace webapi;
 
 void WebRemote::RegisterLibraryApi(httplib::Server &server)
@@ -225,7 +223,7 @@ void WebRemote::RegisterSourceApi(httplib::Server &server)
             Ok(res);
         }
     });
-    server.Post("/api/source/save", [this](Req req, Res res) {
+    server.Post("/api/source/save", [](Req req, Res res) {
         Json::Value body;
         int slot = 0;
         if (!Body(req, res, &body))

@@ -16,8 +16,6 @@
 #include "tools/tarnweb/web_remote.h"
 #include "tools/tarnweb/web_api_util.h"
 
-static const char kLogUnit[] = "tarnweb";
-
 using namespace webapi;
 
 void WebRemote::RegisterTransportApi(httplib::Server &server)
@@ -215,7 +213,7 @@ void WebRemote::RegisterPlayersApi(httplib::Server &server)
             return Error(res, 404, "that renderer is no longer on the network");
         Ok(res);
     });
-    server.Post("/api/players/refresh", [this](Req, Res res) {
+    server.Post("/api/players/refresh", [](Req, Res res) {
         if (Send(res, ACT_SEARCH_RENDERERS, ""))
             Ok(res);
     });

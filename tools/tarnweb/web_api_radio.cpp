@@ -16,8 +16,6 @@
 #include "tools/tarnweb/web_remote.h"
 #include "tools/tarnweb/web_api_util.h"
 
-static const char kLogUnit[] = "tarnweb";
-
 using namespace webapi;
 
 void WebRemote::RegisterRadioApi(httplib::Server &server)

@@ -15,8 +15,6 @@
 #include "platform/tarn_log.h"
 #include "tools/tarnweb/web_remote.h"
 
-static const char kLogUnit[] = "tarnweb";
-
 namespace {
 
 int64_t NowMs()

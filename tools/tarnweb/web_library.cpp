@@ -22,8 +22,6 @@
 #include "platform/tarn_log.h"
 #include "tools/tarnweb/web_remote.h"
 
-static const char kLogUnit[] = "tarnweb";
-
 namespace {
 
 const char kSongColumns[] =
