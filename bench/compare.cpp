@@ -672,28 +672,27 @@ void RoundTrips(Ours &o, Mpd &m, int repeats)
 {
     int n = g_quick ? 500 : 5000;
     std::vector<double> o50, o99, m50, m99, p50o, p50m;
-    for (int r = 0; r < repeats; ++r) {
-        Progress("round trips, run %d/%d (%d requests each side)", r + 1, repeats, n);
-        std::vector<double> to, tm;
-        MeasureRoundTrips(o, m, n, &to, &tm);
-        o50.push_back(Percentile(to, 50));
-        o99.push_back(Percentile(to, 99));
-        m50.push_back(Percentile(tm, 50));
-        m99.push_back(Percentile(tm, 99));
-    }
-    Pin(0, 0);
-    Pin(o.pid, 0);
-    Pin(m.pid, 0);
-    for (int r = 0; r < repeats; ++r) {
-        Progress("round trips on one CPU, run %d/%d (%d requests each side)", r + 1, repeats, n);
-        std::vector<double> to, tm;
-        MeasureRoundTrips(o, m, n, &to, &tm);
-        p50o.push_back(Percentile(to, 50));
-        p50m.push_back(Percentile(tm, 50));
-    }
-    Pin(0, -1);
-    Pin(o.pid, -1);
-    Pin(m.pid, -1);
+    // repeats runs; p50 and (when asked) p99 of each side's run.
+    auto runs = [&](const char *what, std::vector<double> *ours50, std::vector<double> *ours99,
+                    std::vector<double> *mpd50, std::vector<double> *mpd99) {
+        for (int r = 0; r < repeats; ++r) {
+            Progress("round trips%s, run %d/%d (%d requests each side)", what, r + 1, repeats, n);
+            std::vector<double> to, tm;
+            MeasureRoundTrips(o, m, n, &to, &tm);
+            ours50->push_back(Percentile(to, 50));
+            mpd50->push_back(Percentile(tm, 50));
+            if (ours99) {
+                ours99->push_back(Percentile(to, 99));
+                mpd99->push_back(Percentile(tm, 99));
+            }
+        }
+    };
+    runs("", &o50, &o99, &m50, &m99);
+    for (pid_t pid : {static_cast<pid_t>(0), o.pid, m.pid})
+        Pin(pid, 0);
+    runs(" on one CPU", &p50o, nullptr, &p50m, nullptr);
+    for (pid_t pid : {static_cast<pid_t>(0), o.pid, m.pid})
+        Pin(pid, -1);
     AddRow("control round trip p50, fresh connection", "us", o50, m50);
     AddRow("control round trip p99, fresh connection", "us", o99, m99);
     AddRow("control round trip p50, client and daemons on one CPU", "us", p50o, p50m);

@@ -2,7 +2,6 @@
 // actions, the source changes or the selected player, and the reply text.
 #include "daemon/tarnaudiod.h"
 
-#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -15,7 +14,7 @@
 #include "platform/json_text.h"
 #include "platform/tarn_log.h"
 #include "player/localplayer.h"
-#include "player/playlist_page.h"
+#include "player/playlist_actions.h"
 #include "player/upnpplayer.h"
 #include "source/changesrc.h"
 #include "upnp/upnp.h"
@@ -245,52 +244,48 @@ const DaemonAction kDaemonActions[] = {
 
 }  // namespace
 
-void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
-                     UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers)
+namespace {
+
+// A request the daemon answers itself (a source change or one of its own
+// actions) is carried out; false for any other.
+bool DaemonTakes(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
+                 UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers)
 {
     const DaemonAction *own = FindAction(kDaemonActions, request->action);
-    if (own && own->change) {
+    if (!own)
+        return false;
+    if (own->change) {
         // A source change always returns playback to the local player,
         // before the change is even attempted.
         g_localSelected = 1;
         g_selectedRenderer = -1;
         if (own->change(request->parameter, localPlayer) == 0)
             g_changed = 1;
-        return;
+        return true;
     }
-    if (own) {
-        DispatchCall call = {request, reply, localPlayer, controller, upnpPlayers};
-        own->handle(call);
-        return;
-    }
-    // Everything else goes to the selected player.
-    if (g_localSelected) {
-        localPlayer->HandleAction(request, reply);
-        return;
-    }
-    if (g_selectedRenderer == -1)
-        return;
-    UpnpPlayer *player = FindPlayerByIndex(upnpPlayers, g_selectedRenderer);
-    if (!player) {
-        TarnLog("%s:%d No upnp player index [%d]", kLogUnit, 395, g_selectedRenderer);
-        return;
-    }
-    player->HandleAction(request, reply);
+    DispatchCall call = {request, reply, localPlayer, controller, upnpPlayers};
+    own->handle(call);
+    return true;
 }
 
-namespace {
+// The player every other request goes to: the local player or the selected
+// renderer's; neither when no renderer is selected, or when the selected
+// one has no player (logged).
+struct SelectedPlayer {
+    LocalPlayer *local;
+    UpnpPlayer *upnp;
+};
 
-// The selected player's queue, for a page written straight from it; null
-// when another path is to answer (nothing selected, or a selection whose
-// player is missing, which that path logs).
-Playlist *SelectedQueue(LocalPlayer *localPlayer, std::vector<UpnpPlayer *> &upnpPlayers)
+SelectedPlayer FindSelected(LocalPlayer *localPlayer, std::vector<UpnpPlayer *> &upnpPlayers)
 {
     if (g_localSelected)
-        return localPlayer->GetPlaylist();
+        return {localPlayer, nullptr};
     if (g_selectedRenderer == -1)
-        return nullptr;
+        return {nullptr, nullptr};
     UpnpPlayer *player = FindPlayerByIndex(upnpPlayers, g_selectedRenderer);
-    return player ? player->GetPlaylist() : nullptr;
+    if (!player)
+        TarnLog("%s:%d No upnp player index [%d]", kLogUnit, 395, g_selectedRenderer);
+    return {nullptr, player};
 }
 
 }  // namespace
@@ -298,26 +293,24 @@ Playlist *SelectedQueue(LocalPlayer *localPlayer, std::vector<UpnpPlayer *> &upn
 void AnswerRequest(const ControlRequest *request, char out[CTRL_REPLY_SIZE], LocalPlayer *localPlayer,
                    UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers)
 {
-    Playlist *queue = request->action == ACT_QUEUE_LIST ? SelectedQueue(localPlayer, upnpPlayers) : nullptr;
-    if (queue) {
-        // The text the page's JSON value would give, without building it.
-        std::string param(request->parameter, strnlen(request->parameter, sizeof(request->parameter)));
-        int start = 0;
-        int limit = 0;
-        sscanf(param.c_str(), "%d %d", &start, &limit);
-        std::string text;
-        // A renderer player's queue is read under the controller's lock.
-        if (controller)
-            controller->Lock();
-        PlaylistPageText(*queue, start, limit, CTRL_REPLY_SIZE - 1, &text);
-        if (controller)
-            controller->Unlock();
-        memset(out, 0, CTRL_REPLY_SIZE);
-        memcpy(out, text.data(), std::min(text.size(), static_cast<size_t>(CTRL_REPLY_SIZE - 1)));
-        return;
-    }
     Json::Value reply;  // null unless a handler fills it
-    DispatchRequest(request, reply, localPlayer, controller, upnpPlayers);
+    if (!DaemonTakes(request, reply, localPlayer, controller, upnpPlayers)) {
+        SelectedPlayer selected = FindSelected(localPlayer, upnpPlayers);
+        if (request->action == ACT_QUEUE_LIST && (selected.local || selected.upnp)) {
+            // A renderer player's queue is read under the controller's lock.
+            if (selected.upnp)
+                controller->Lock();
+            Playlist *queue = selected.local ? selected.local->GetPlaylist() : selected.upnp->GetPlaylist();
+            PlaylistPageReply(*queue, request, out);
+            if (selected.upnp)
+                controller->Unlock();
+            return;
+        }
+        if (selected.local)
+            selected.local->HandleAction(request, reply);
+        else if (selected.upnp)
+            selected.upnp->HandleAction(request, reply);
+    }
     FormatReply(reply, out);
 }
 

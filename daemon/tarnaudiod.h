@@ -70,11 +70,6 @@ int DaemonRun();
 int HandleRequest(int fd, LocalPlayer *localPlayer, UpnpController *controller,
                   std::vector<UpnpPlayer *> &upnpPlayers);
 
-// Dispatches a request that has been read: the daemon's own actions, the
-// source changes and the selected player. The reply value is filled in.
-void DispatchRequest(const ControlRequest *request, Json::Value &reply, LocalPlayer *localPlayer,
-                     UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers);
-
 // Serves the ready connection fd of ctx.conns: one read of the request (a
 // short one closes the connection), dispatch, and the reply handed to
 // ctx.conns to write.
@@ -88,8 +83,9 @@ UpnpPlayer *FindPlayerByIndex(std::vector<UpnpPlayer *> &players, int index);
 // NUL-terminated in an 8192-byte buffer.
 void FormatReply(const Json::Value &reply, char buffer[CTRL_REPLY_SIZE]);
 
-// The reply text of one request into out (dispatched, or for a queue page
-// written straight from the selected player's queue: the same text).
+// The reply text of one request into out: the daemon's own actions, the
+// source changes, or the selected player's (a queue page is written straight
+// from its queue, the same text its JSON value would give).
 void AnswerRequest(const ControlRequest *request, char out[CTRL_REPLY_SIZE], LocalPlayer *localPlayer,
                    UpnpController *controller, std::vector<UpnpPlayer *> &upnpPlayers);
 

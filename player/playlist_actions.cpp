@@ -102,11 +102,18 @@ void QueueShuffle(Playlist &playlist, const ControlRequest *, const std::string 
     playlist.ToggleShuffle();
 }
 
+// The start and limit of a page request ("%d %d", each 0 when missing).
+void PageOf(const std::string &text, int *start, int *limit)
+{
+    *start = 0;
+    *limit = 0;
+    sscanf(text.c_str(), "%d %d", start, limit);
+}
+
 void QueueList(Playlist &playlist, const ControlRequest *, const std::string &text, Json::Value &reply)
 {
-    int start = 0;
-    int limit = 0;
-    sscanf(text.c_str(), "%d %d", &start, &limit);
+    int start, limit;
+    PageOf(text, &start, &limit);
     PlaylistListJson(playlist, start, limit, reply);
 }
 
@@ -150,4 +157,15 @@ int PlaylistHandleAction(Playlist &playlist, const ControlRequest *request, Json
     std::string text(request->parameter, strnlen(request->parameter, sizeof(request->parameter)));
     q->handle(playlist, request, text, reply);
     return 0;
+}
+
+void PlaylistPageReply(const Playlist &playlist, const ControlRequest *request, char out[CTRL_REPLY_SIZE])
+{
+    int start, limit;
+    PageOf(std::string(request->parameter, strnlen(request->parameter, sizeof(request->parameter))), &start,
+           &limit);
+    std::string text;
+    PlaylistPageText(playlist, start, limit, CTRL_REPLY_SIZE - 1, &text);
+    memset(out, 0, CTRL_REPLY_SIZE);
+    memcpy(out, text.data(), text.size());
 }

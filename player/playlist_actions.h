@@ -24,4 +24,9 @@ bool PlaylistTakesAction(int action);
 // action that is not the queue's.
 int PlaylistHandleAction(Playlist &playlist, const ControlRequest *request, Json::Value &reply);
 
+// The reply of an ACT_QUEUE_LIST request, written straight from the queue:
+// the text of PlaylistListJson's page cut to the reply by whole entries,
+// NUL-terminated in out.
+void PlaylistPageReply(const Playlist &playlist, const ControlRequest *request, char out[CTRL_REPLY_SIZE]);
+
 #endif
